@@ -1,0 +1,246 @@
+// Stand-in for the maker's utility library libox_cu: per-thread current
+// error, clock, POSIX-locale case-insensitive compare, active cluster name.
+// Thread-safety: the error record is thread-local; the cluster override and
+// clock override are guarded by g_mutex / atomics.
+#include "ox_cu.h"
+
+#include <atomic>
+#include <cerrno>
+#include <cstdarg>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+#include <mutex>
+#include <string>
+#include <vector>
+
+struct cu_error {
+    int status = 0;
+    int reserved = 0;
+    std::string catalog;
+    int set = 0;
+    int msgno = 0;
+    std::string deftext;
+    std::string text;
+    std::vector<std::string> inserts;
+    std::vector<unsigned long long> raw;
+};
+
+namespace {
+
+thread_local bool t_pending = false;
+thread_local cu_error t_error;
+thread_local unsigned long t_count = 0;
+std::atomic<unsigned long> g_handles{0};
+
+std::mutex g_mutex;
+bool g_cluster_override = false;
+std::string g_cluster_name;
+std::atomic<int> g_cluster_fail{0};
+std::atomic<int64_t> g_clock{0};
+
+struct Conv {
+    int index;      // 1-based insert number
+    char type;      // 's', 'd', 'x', 'u'
+    size_t begin;   // position of '%'
+    size_t end;     // one past the conversion character
+};
+
+// Finds the positional conversions "%N$s", "%N$d", "%N$x" (plain "%s"/"%d"
+// count in order of appearance).  "%%" is a literal percent sign.
+std::vector<Conv> conversions(const std::string &fmt) {
+    std::vector<Conv> out;
+    int next = 1;
+    for (size_t i = 0; i < fmt.size(); ++i) {
+        if (fmt[i] != '%') continue;
+        if (i + 1 < fmt.size() && fmt[i + 1] == '%') { ++i; continue; }
+        size_t j = i + 1;
+        int index = 0;
+        size_t k = j;
+        while (k < fmt.size() && fmt[k] >= '0' && fmt[k] <= '9') index = index * 10 + (fmt[k++] - '0');
+        if (k < fmt.size() && fmt[k] == '$' && index > 0) j = k + 1; else index = next++;
+        while (j < fmt.size() && std::strchr("-+ #0123456789.l", fmt[j])) ++j;
+        if (j >= fmt.size()) break;
+        char t = fmt[j];
+        if (t == 'i') t = 'd';
+        if (t == 'X') t = 'x';
+        if (std::strchr("sdxu", t)) out.push_back({index, t, i, j + 1});
+        i = j;
+    }
+    return out;
+}
+
+}  // namespace
+
+extern "C" int cu_set_error_1(int status, int reserved, const char *catalog, int set, int msgno,
+                              const char *deftext, ...) {
+    cu_error e;
+    e.status = status;
+    e.reserved = reserved;
+    e.catalog = catalog ? catalog : "";
+    e.set = set;
+    e.msgno = msgno;
+    e.deftext = deftext ? deftext : "";
+    std::vector<Conv> convs = conversions(e.deftext);
+    int n = 0;
+    for (const Conv &c : convs) n = std::max(n, c.index);
+    std::vector<char> types(n + 1, 'd');
+    for (const Conv &c : convs) types[c.index] = c.type;
+    e.inserts.resize(n);
+    e.raw.resize(n);
+    va_list ap;
+    va_start(ap, deftext);
+    for (int i = 1; i <= n; ++i) {
+        char buf[64];
+        switch (types[i]) {
+        case 's': {
+            const char *s = va_arg(ap, const char *);
+            e.inserts[i - 1] = s ? s : "(null)";
+            break;
+        }
+        case 'x': {
+            // Pointer-sized on purpose: callers pass the offending value itself.
+            unsigned long long v = va_arg(ap, unsigned long long);
+            e.raw[i - 1] = v;
+            std::snprintf(buf, sizeof buf, "%x", static_cast<unsigned>(v));
+            e.inserts[i - 1] = buf;
+            break;
+        }
+        case 'u': {
+            unsigned v = va_arg(ap, unsigned);
+            e.raw[i - 1] = v;
+            std::snprintf(buf, sizeof buf, "%u", v);
+            e.inserts[i - 1] = buf;
+            break;
+        }
+        default: {
+            int v = va_arg(ap, int);
+            e.raw[i - 1] = static_cast<unsigned long long>(static_cast<long long>(v));
+            std::snprintf(buf, sizeof buf, "%d", v);
+            e.inserts[i - 1] = buf;
+            break;
+        }
+        }
+    }
+    va_end(ap);
+    std::string text;
+    size_t pos = 0;
+    for (const Conv &c : convs) {
+        text.append(e.deftext, pos, c.begin - pos);
+        text += e.inserts[c.index - 1];
+        pos = c.end;
+    }
+    text.append(e.deftext, pos, std::string::npos);
+    // "%%" stands for one percent sign.
+    for (size_t i = 0; (i = text.find("%%", i)) != std::string::npos; ++i) text.erase(i, 1);
+    e.text = std::move(text);
+    t_error = std::move(e);
+    t_pending = true;
+    ++t_count;
+    return status;
+}
+
+extern "C" int cu_get_error_1(cu_error_t **handle) {
+    if (!handle) return 4;
+    if (!t_pending) return 0;
+    *handle = new (std::nothrow) cu_error(t_error);
+    if (!*handle) return 6;
+    g_handles.fetch_add(1);
+    return 0;
+}
+
+extern "C" int cu_pset_error_1(const cu_error_t *handle) {
+    if (!handle) return 4;
+    t_error = *handle;
+    t_pending = true;
+    return 0;
+}
+
+extern "C" void cu_rel_error_1(cu_error_t *handle) {
+    if (!handle) return;
+    delete handle;
+    g_handles.fetch_sub(1);
+}
+
+extern "C" int cu_gettimeofday_1(struct timeval *tv, void *tz) {
+    if (!tv) return 4;
+    int64_t fixed = g_clock.load(std::memory_order_relaxed);
+    if (fixed != 0) {
+        tv->tv_sec = static_cast<time_t>(fixed);
+        tv->tv_usec = 0;
+        return 0;
+    }
+    return gettimeofday(tv, static_cast<struct timezone *>(tz)) == 0 ? 0 : errno;
+}
+
+extern "C" int cu_8bit_strncasecmp_posix_1(const char *s1, const char *s2, size_t n) {
+    // The POSIX locale maps only A-Z to a-z, whatever the process locale is.
+    auto lower = [](unsigned char c) { return (c >= 'A' && c <= 'Z') ? c + ('a' - 'A') : c; };
+    for (size_t i = 0; i < n; ++i) {
+        int a = lower(static_cast<unsigned char>(s1[i]));
+        int b = lower(static_cast<unsigned char>(s2[i]));
+        if (a != b) return a - b;
+        if (a == 0) return 0;
+    }
+    return 0;
+}
+
+extern "C" int cu_get_cluster_info_1(cu_cluster_info_t *info) {
+    if (!info) return 4;
+    if (g_cluster_fail.load()) return 1;
+    std::string name;
+    {
+        std::lock_guard<std::mutex> lock(g_mutex);
+        if (g_cluster_override) name = g_cluster_name;
+    }
+    if (name.empty()) {
+        bool overridden;
+        {
+            std::lock_guard<std::mutex> lock(g_mutex);
+            overridden = g_cluster_override;
+        }
+        if (overridden) return 1;
+        FILE *f = std::fopen(CU_ACTIVE_CLUSTER_FILE, "re");
+        if (!f) return 1;
+        char line[256];
+        bool got = std::fgets(line, sizeof line, f) != nullptr;
+        std::fclose(f);
+        if (!got) return 1;
+        line[std::strcspn(line, "\r\n")] = '\0';
+        name = line;
+        if (name.empty()) return 1;
+    }
+    std::memset(info, 0, sizeof *info);
+    info->version = 1;
+    std::snprintf(info->cluster_name, sizeof info->cluster_name, "%s", name.c_str());
+    return 0;
+}
+
+// ---- inspection ----
+extern "C" int cux_error_pending(void) { return t_pending ? 1 : 0; }
+extern "C" void cux_clear_error(void) { t_pending = false; t_error = cu_error(); }
+extern "C" unsigned long cux_error_count(void) { return t_count; }
+extern "C" int cux_error_status(void) { return t_pending ? t_error.status : 0; }
+extern "C" int cux_error_reserved(void) { return t_error.reserved; }
+extern "C" const char *cux_error_catalog(void) { return t_error.catalog.c_str(); }
+extern "C" int cux_error_set(void) { return t_error.set; }
+extern "C" int cux_error_msgno(void) { return t_pending ? t_error.msgno : 0; }
+extern "C" const char *cux_error_deftext(void) { return t_error.deftext.c_str(); }
+extern "C" const char *cux_error_text(void) { return t_error.text.c_str(); }
+extern "C" int cux_error_insert_count(void) { return static_cast<int>(t_error.inserts.size()); }
+extern "C" const char *cux_error_insert(int i) {
+    if (i < 1 || i > static_cast<int>(t_error.inserts.size())) return nullptr;
+    return t_error.inserts[i - 1].c_str();
+}
+extern "C" unsigned long long cux_error_insert_raw(int i) {
+    if (i < 1 || i > static_cast<int>(t_error.raw.size())) return 0;
+    return t_error.raw[i - 1];
+}
+extern "C" unsigned long cux_handles_live(void) { return g_handles.load(); }
+extern "C" void cux_set_active_cluster(const char *name) {
+    std::lock_guard<std::mutex> lock(g_mutex);
+    g_cluster_override = name != nullptr;
+    g_cluster_name = name ? name : "";
+}
+extern "C" void cux_fail_cluster_info(int fail) { g_cluster_fail.store(fail); }
+extern "C" void cux_set_clock(int64_t seconds) { g_clock.store(seconds); }

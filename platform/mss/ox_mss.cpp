@@ -1,0 +1,145 @@
+// Stand-in for the maker's security support library libox_mss: opening,
+// shared locking and time queries of configuration files.  Locks are
+// open-file-description locks so that they belong to the descriptor, not to
+// the process.  Forced results (tests) are guarded by g_mutex.
+#include "ox_mss.h"
+
+#include <atomic>
+#include <cerrno>
+#include <cstring>
+#include <fcntl.h>
+#include <mutex>
+#include <string>
+#include <sys/stat.h>
+#include <time.h>
+#include <unistd.h>
+
+namespace {
+
+std::atomic<int> g_wait_ms{5000};
+std::atomic<long> g_locks{0};
+std::mutex g_mutex;
+std::string *g_open_path = new std::string;  // never destroyed
+int g_open_result = 0;
+bool g_open_any = false;
+std::string *g_time_path = new std::string;
+int g_time_result = 0;
+bool g_time_any = false;
+std::atomic<int> g_lock_result{0};
+
+int forced(const std::string &want, bool any, int result, const char *path) {
+    if (result == 0) return 0;
+    if (any || (path && want == path)) return result;
+    return 0;
+}
+
+int lock_op(int fd, short type, bool wait) {
+    struct flock fl;
+    std::memset(&fl, 0, sizeof fl);
+    fl.l_type = type;
+    fl.l_whence = SEEK_SET;
+    fl.l_start = 0;
+    fl.l_len = 0;
+    if (!wait) return fcntl(fd, F_OFD_SETLK, &fl) == 0 ? 0 : errno;
+    const int total = g_wait_ms.load();
+    struct timespec start;
+    clock_gettime(CLOCK_MONOTONIC, &start);
+    for (;;) {
+        if (fcntl(fd, F_OFD_SETLK, &fl) == 0) return 0;
+        int e = errno;
+        if (e != EAGAIN && e != EACCES && e != EINTR) return e;
+        struct timespec now;
+        clock_gettime(CLOCK_MONOTONIC, &now);
+        long elapsed = (now.tv_sec - start.tv_sec) * 1000 + (now.tv_nsec - start.tv_nsec) / 1000000;
+        if (elapsed >= total) return EAGAIN;
+        struct timespec pause = {0, 5 * 1000 * 1000};
+        nanosleep(&pause, nullptr);  // a cancellation point
+    }
+}
+
+}  // namespace
+
+extern "C" int sec__open_file(const char *path, int flags, int *fd) {
+    (void)flags;
+    if (!path || !fd) return 23;
+    {
+        std::lock_guard<std::mutex> lock(g_mutex);
+        if (int r = forced(*g_open_path, g_open_any, g_open_result, path)) return r;
+    }
+    int d = open(path, O_RDONLY | O_CLOEXEC);
+    if (d < 0) {
+        switch (errno) {
+        case EACCES:
+        case EPERM: return 12;
+        case ENOENT:
+        case ENOTDIR: return 21;
+        case ENOMEM: return 6;
+        default: return 23;
+        }
+    }
+    *fd = d;
+    return 0;
+}
+
+extern "C" int sec__readlock_file(int fd, const char *caller) {
+    (void)caller;
+    if (int r = g_lock_result.load()) return r;
+    int e = lock_op(fd, F_RDLCK, true);
+    if (e == 0) {
+        g_locks.fetch_add(1);
+        return 0;
+    }
+    return e == EAGAIN ? 30 : 23;
+}
+
+extern "C" int sec__unlock_file(int fd, const char *caller) {
+    (void)caller;
+    if (lock_op(fd, F_UNLCK, false) != 0) return 23;
+    g_locks.fetch_sub(1);
+    return 0;
+}
+
+extern "C" int sec__close_file(int *fd) {
+    if (!fd || *fd < 0) return 23;
+    int r = close(*fd);
+    *fd = -1;
+    return r == 0 ? 0 : 23;
+}
+
+extern "C" int sec__time_file(const char *path, uint32_t *mtime) {
+    if (!path || !mtime) return 23;
+    {
+        std::lock_guard<std::mutex> lock(g_mutex);
+        if (int r = forced(*g_time_path, g_time_any, g_time_result, path)) return r;
+    }
+    struct stat st;
+    if (stat(path, &st) != 0) {
+        if (errno == ENOENT || errno == ENOTDIR) return 21;
+        if (errno == EACCES) return 12;
+        return 23;
+    }
+    *mtime = static_cast<uint32_t>(st.st_mtime);
+    return 0;
+}
+
+extern "C" void mssx_set_lock_wait_ms(int ms) { g_wait_ms.store(ms < 0 ? 0 : ms); }
+extern "C" void mssx_force_open(const char *path, int result) {
+    std::lock_guard<std::mutex> lock(g_mutex);
+    *g_open_path = path ? path : "";
+    g_open_any = path == nullptr;
+    g_open_result = result;
+}
+extern "C" void mssx_force_readlock(int result) { g_lock_result.store(result); }
+extern "C" void mssx_force_time(const char *path, int result) {
+    std::lock_guard<std::mutex> lock(g_mutex);
+    *g_time_path = path ? path : "";
+    g_time_any = path == nullptr;
+    g_time_result = result;
+}
+extern "C" long mssx_locks_held(void) { return g_locks.load(); }
+extern "C" void mssx_reset(void) {
+    mssx_force_open(nullptr, 0);
+    mssx_force_time(nullptr, 0);
+    mssx_force_readlock(0);
+    g_wait_ms.store(5000);
+}

@@ -1,0 +1,2 @@
+// Placeholder; the module arrives with its issue.
+#include "oxidm_internal.h"

@@ -1,0 +1,78 @@
+// Trace component "_SEI": registration with libox_tr, the category table,
+// the detail levels, and the dump routines for rules and ids.
+//
+// Owns: idm__trace_detail_levels (written by libox_tr, read by every trace
+// point), idm__trace_categories and null_string (constant in practice).
+// Registration runs once per process under idm__trace_register_once; the
+// component is never unregistered by the library.
+#include "oxidm_internal.h"
+
+using namespace idm;
+
+extern "C" {
+
+unsigned char idm__trace_detail_levels[5];
+pthread_once_t idm__trace_register_once = PTHREAD_ONCE_INIT;
+const char *null_string = "<null>";
+
+// Category table as libox_tr receives it: number, name, a null field.
+static const tr_category_t idm__trace_categories[5] = {
+    {0, "Error", nullptr}, {1, "API", nullptr}, {2, "Mapping", nullptr},
+    {3, "Milestone", nullptr}, {4, "Diag", nullptr},
+};
+
+// Registers "_SEI".  The error that was current before registration is made
+// current again afterwards, whatever libox_tr recorded meanwhile.
+int idm__trace_register_oxidm(void) {
+    cu_error_t *pending = nullptr;
+    cu_get_error_1(&pending);
+    int rc = tr_register_component_1(trace::kComponent, idm__trace_detail_levels, idm__trace_categories, 5);
+    if (pending != nullptr) cu_pset_error_1(pending);
+    return rc;
+}
+
+void idm__trace_register_once_routine(void) { (void)idm__trace_register_oxidm(); }
+
+int idm__trace_unregister_oxidm(void) { return tr_unregister_component_1(trace::kComponent); }
+
+int idm__trace_routine_end(const char *name, int32_t status) {
+    unsigned char l = trace::level(trace::kApi);
+    if (name == nullptr || *name == '\0') return 0;
+    if (l == 1) return tr_record_strings_1(trace::kComponent, 2, 1, name);
+    if (l == 8)
+        return tr_record_data_1(trace::kComponent, 3, 2, static_cast<const void *>(name), std::strlen(name) + 1,
+                                static_cast<const void *>(&status), size_t{4});
+    return 0;
+}
+
+static void trace_tokens(int32_t count, char *const *tokens) {
+    for (int32_t i = 1; i <= count; ++i) {
+        const char *token = tokens != nullptr ? tokens[i - 1] : nullptr;
+        trace::record_data(139, trace::i32(i), trace::text(token != nullptr ? token : null_string));
+    }
+}
+
+void idm__trace_native_rule(const idm_rule *rule) {
+    if (rule == nullptr) return;
+    idm_rule copy = *rule;
+    if (copy.rgy_type == nullptr) copy.rgy_type = const_cast<char *>(null_string);
+    if (copy.rgy == nullptr) copy.rgy = const_cast<char *>(null_string);
+    trace::record_data(136, trace::u32(copy.rule_state), trace::text(copy.rgy_type), trace::text(copy.rgy),
+                       trace::i32(copy.token_cnt));
+    trace_tokens(copy.token_cnt, copy.tokens);
+    if (copy.mapping != nullptr) {
+        const char *value = copy.mapping->value != nullptr ? copy.mapping->value : null_string;
+        trace::record_data(138, trace::u32(copy.mapping->length), trace::text(value));
+    }
+}
+
+void idm__trace_native_id(const idm_id *id) {
+    if (id == nullptr) return;
+    idm_id copy = *id;
+    if (copy.rgy_type == nullptr) copy.rgy_type = const_cast<char *>(null_string);
+    if (copy.rgy == nullptr) copy.rgy = const_cast<char *>(null_string);
+    trace::record_data(137, trace::text(copy.rgy_type), trace::text(copy.rgy), trace::i32(copy.token_cnt));
+    trace_tokens(copy.token_cnt, copy.tokens);
+}
+
+}  // extern "C"

@@ -1,0 +1,126 @@
+// Trace points of component "_SEI".
+//
+// The detail levels live in idm__trace_detail_levels, one byte per category,
+// written by libox_tr after registration and read here without a lock.  Every
+// trace point first runs the once-control that registers the component, then
+// reads one level byte; records are built only when a level asks for them.
+//
+// Usage in a traced routine:
+//     trace::Api api(kIds, trace::text(mnemonic), trace::ptr(buffer));
+//     ...
+//     return api.leave(status);
+#ifndef OXIDM_TRACE_H
+#define OXIDM_TRACE_H
+
+#include <pthread.h>
+
+#include <array>
+#include <cstddef>
+#include <cstdint>
+#include <cstring>
+#include <utility>
+
+#include "ox_tr.h"
+
+extern "C" {
+extern unsigned char idm__trace_detail_levels[5];
+extern pthread_once_t idm__trace_register_once;
+extern const char *null_string;  // "<null>", recorded in place of a missing text
+int idm__trace_register_oxidm(void);
+int idm__trace_unregister_oxidm(void);
+int idm__trace_routine_end(const char *name, int32_t status);
+struct idm_rule;
+struct idm_id;
+void idm__trace_native_rule(const struct idm_rule *rule);
+void idm__trace_native_id(const struct idm_id *id);
+void idm__trace_register_once_routine(void);
+}
+
+namespace idm::trace {
+
+inline constexpr const char kComponent[] = "_SEI";
+
+enum Category : int { kError = 0, kApi = 1, kMapping = 2, kMilestone = 3, kDiag = 4 };
+
+// Runs the registration once-control and reads one level byte.
+inline unsigned char level(Category c) {
+    pthread_once(&idm__trace_register_once, idm__trace_register_once_routine);
+    return __atomic_load_n(&idm__trace_detail_levels[c], __ATOMIC_RELAXED);
+}
+inline bool error_on() { return level(kError) != 0 || level(kDiag) != 0; }
+inline bool diag_on() { return level(kDiag) != 0; }
+
+// One data item: address and length.  A text's length (with its NUL) is
+// taken only when the record is actually written.
+struct Item {
+    const void *p;
+    size_t len;
+};
+inline constexpr size_t kTextLen = ~size_t{0};
+
+inline Item text(const char *s, const char *if_null = "<null>") { return {s ? s : if_null, kTextLen}; }
+inline Item i32(const int32_t &v) { return {&v, 4}; }
+inline Item u32(const uint32_t &v) { return {&v, 4}; }
+inline Item i64(const int64_t &v) { return {&v, 8}; }
+// The 8 bytes of the variable that holds a pointer.
+template <class T>
+inline Item ptr(T *const &p) { return {&p, 8}; }
+
+inline void record_id(int id) { tr_record_id_1(kComponent, id); }
+
+template <size_t I, size_t N>
+inline auto flat(const std::array<Item, N> &a) {
+    if constexpr (I % 2 == 0) return a[I / 2].p;
+    else return a[I / 2].len;
+}
+template <size_t N, size_t... I>
+inline void record_flat(int id, const std::array<Item, N> &a, std::index_sequence<I...>) {
+    tr_record_data_1(kComponent, id, static_cast<int>(N), flat<I>(a)...);
+}
+
+template <class... Items>
+inline void record_data(int id, Items... items) {
+    std::array<Item, sizeof...(Items)> a{items...};
+    for (Item &it : a)
+        if (it.len == kTextLen) it.len = std::strlen(static_cast<const char *>(it.p)) + 1;
+    record_flat(id, a, std::make_index_sequence<2 * sizeof...(Items)>{});
+}
+
+template <class... Texts>
+inline void record_strings(int id, Texts... texts) {
+    tr_record_strings_1(kComponent, id, static_cast<int>(sizeof...(Texts)), static_cast<const char *>(texts)...);
+}
+
+// The four ids of a routine traced with the entry/exit pattern.
+struct ApiIds {
+    int entry;       // API level 1
+    int entry_data;  // API level 8
+    int exit;        // API level 1
+    int exit_data;   // API level 8
+};
+
+// Entry point in the constructor, exit point in leave(); leave() reads the
+// API level afresh, as it may have changed meanwhile.
+class Api {
+  public:
+    template <class... Items>
+    explicit Api(const ApiIds &ids, Items... items) : ids_(ids) {
+        unsigned char l = level(kApi);
+        if (l == 1) record_id(ids_.entry);
+        else if (l == 8) record_data(ids_.entry_data, items...);
+    }
+    template <class... Items>
+    int32_t leave(int32_t status, Items... more) const {
+        unsigned char l = level(kApi);
+        if (l == 1) record_id(ids_.exit);
+        else if (l == 8) record_data(ids_.exit_data, i32(status), more...);
+        return status;
+    }
+
+  private:
+    const ApiIds &ids_;
+};
+
+}  // namespace idm::trace
+
+#endif

@@ -1,0 +1,23 @@
+# Fails unless the library's dynamic symbol table defines exactly the seven
+# exported functions (plus the version node).
+execute_process(COMMAND nm -D --defined-only ${LIB} OUTPUT_VARIABLE out RESULT_VARIABLE rc)
+if(NOT rc EQUAL 0)
+  message(FATAL_ERROR "nm failed on ${LIB}")
+endif()
+string(REGEX MATCHALL "[^\n]+" lines "${out}")
+set(names)
+foreach(line IN LISTS lines)
+  string(REGEX REPLACE "^[0-9a-f]* *[A-Za-z] " "" name "${line}")
+  string(REGEX REPLACE "@.*" "" name "${name}")
+  if(NOT name STREQUAL "OXIDM_1")
+    list(APPEND names ${name})
+  endif()
+endforeach()
+list(SORT names)
+set(expected _sec_idm_get_translator sec__idm_clmap_init sec_idm_get_groups sec_idm_map_identity
+             sec_idm_register_translator sec_is_in_active_cluster sec_is_in_any_cluster)
+list(SORT expected)
+if(NOT names STREQUAL expected)
+  message(FATAL_ERROR "exported: ${names}\nexpected: ${expected}")
+endif()
+message(STATUS "exports OK: ${names}")

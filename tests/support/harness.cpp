@@ -1,0 +1,219 @@
+#include "harness.h"
+
+#include <fcntl.h>
+#include <sched.h>
+#include <sys/mount.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <cstdio>
+#include <cstring>
+#include <fstream>
+
+namespace oxtest {
+
+namespace {
+
+bool g_namespace = false;
+
+bool write_proc(const char *path, const std::string &text) {
+    int fd = open(path, O_WRONLY | O_CLOEXEC);
+    if (fd < 0) return false;
+    bool ok = write(fd, text.data(), text.size()) == static_cast<ssize_t>(text.size());
+    close(fd);
+    return ok;
+}
+
+bool mkdirs(const std::string &path) {
+    for (size_t i = 1; i <= path.size(); ++i) {
+        if (i == path.size() || path[i] == '/') {
+            std::string part = path.substr(0, i);
+            if (mkdir(part.c_str(), 0755) != 0 && errno != EEXIST) return false;
+        }
+    }
+    return true;
+}
+
+bool overlay(const char *dir, const char *scratch) {
+    std::string upper = std::string(scratch) + "/upper";
+    std::string work = std::string(scratch) + "/work";
+    if (!mkdirs(upper) || !mkdirs(work)) return false;
+    std::string opts = "lowerdir=" + std::string(dir) + ",upperdir=" + upper + ",workdir=" + work;
+    return mount("overlay", dir, "overlay", 0, opts.c_str()) == 0;
+}
+
+bool fresh_tmpfs(const char *dir) {
+    umount2(dir, MNT_DETACH);
+    return mount("tmpfs", dir, "tmpfs", 0, "mode=0755") == 0;
+}
+
+}  // namespace
+
+bool enter_private_namespace() {
+    if (g_namespace) return true;
+    uid_t uid = geteuid();
+    gid_t gid = getegid();
+    if (uid == 0) {
+        if (unshare(CLONE_NEWNS) != 0) return false;
+    } else {
+        if (unshare(CLONE_NEWUSER | CLONE_NEWNS) != 0) return false;
+        write_proc("/proc/self/setgroups", "deny");
+        if (!write_proc("/proc/self/uid_map", "0 " + std::to_string(uid) + " 1")) return false;
+        if (!write_proc("/proc/self/gid_map", "0 " + std::to_string(gid) + " 1")) return false;
+    }
+    if (mount(nullptr, "/", nullptr, MS_REC | MS_PRIVATE, nullptr) != 0) return false;
+    // A private /tmp holds the overlays' upper layers; the host's /var and
+    // /opt are never written.
+    if (mount("tmpfs", "/tmp", "tmpfs", 0, "mode=1777") != 0) return false;
+    if (!overlay("/var", "/tmp/.oxtest-var") || !overlay("/opt", "/tmp/.oxtest-opt")) return false;
+    if (!mkdirs(kVarCfg) || !mkdirs(kOptCfg)) return false;
+    if (!fresh_tmpfs(kVarCfg) || !fresh_tmpfs(kOptCfg)) return false;
+    g_namespace = true;
+    return true;
+}
+
+bool in_private_namespace() { return g_namespace; }
+
+void fresh_config_dirs() {
+    if (!g_namespace) return;
+    fresh_tmpfs(kVarCfg);
+    fresh_tmpfs(kOptCfg);
+}
+
+void write_file(const std::string &path, const std::string &content, int64_t mtime) {
+    std::string tmp = path + ".tmp";
+    {
+        std::ofstream out(tmp, std::ios::binary | std::ios::trunc);
+        out.write(content.data(), static_cast<std::streamsize>(content.size()));
+    }
+    if (std::rename(tmp.c_str(), path.c_str()) != 0) ADD_FAILURE() << "cannot write " << path;
+    if (mtime >= 0) set_mtime(path, mtime);
+}
+
+void set_mtime(const std::string &path, int64_t mtime) {
+    struct timespec times[2];
+    times[0].tv_sec = mtime;
+    times[0].tv_nsec = 0;
+    times[1] = times[0];
+    if (utimensat(AT_FDCWD, path.c_str(), times, 0) != 0) ADD_FAILURE() << "utimensat " << path;
+}
+
+void remove_file(const std::string &path) { unlink(path.c_str()); }
+
+Error last_error() {
+    Error e{cux_error_status(), cux_error_msgno(), {}};
+    for (int i = 1; i <= cux_error_insert_count(); ++i) e.inserts.emplace_back(cux_error_insert(i));
+    return e;
+}
+
+::testing::AssertionResult reported(int status, int msgno, const std::vector<std::string> &inserts) {
+    if (!cux_error_pending()) return ::testing::AssertionFailure() << "no error reported";
+    Error e = last_error();
+    auto fail = [&]() {
+        auto r = ::testing::AssertionFailure();
+        r << "reported status " << e.status << " message " << e.msgno << " inserts [";
+        for (const auto &s : e.inserts) r << '"' << s << "\" ";
+        r << "]; expected status " << status << " message " << msgno << " inserts [";
+        for (const auto &s : inserts) r << '"' << s << "\" ";
+        return r << "]";
+    };
+    if (e.status != status || e.msgno != msgno || e.inserts != inserts) return fail();
+    if (std::strcmp(cux_error_catalog(), "oxseclib.cat") != 0 || cux_error_set() != 1 || cux_error_reserved() != 0)
+        return ::testing::AssertionFailure() << "catalogue/set/reserved arguments wrong";
+    return ::testing::AssertionSuccess();
+}
+
+static unsigned long g_error_mark = 0;
+
+void clear_errors() {
+    cux_clear_error();
+    g_error_mark = cux_error_count();
+}
+
+::testing::AssertionResult nothing_reported() {
+    if (cux_error_count() == g_error_mark) return ::testing::AssertionSuccess();
+    Error e = last_error();
+    return ::testing::AssertionFailure() << "unexpected report: status " << e.status << " message " << e.msgno;
+}
+
+int32_t TraceRecord::i32(size_t j) const {
+    int32_t v = 0;
+    if (j < items.size() && items[j].size() == 4) std::memcpy(&v, items[j].data(), 4);
+    return v;
+}
+uint64_t TraceRecord::u64(size_t j) const {
+    uint64_t v = 0;
+    if (j < items.size() && items[j].size() == 8) std::memcpy(&v, items[j].data(), 8);
+    return v;
+}
+std::string TraceRecord::text(size_t j) const {
+    if (j >= items.size() || items[j].empty() || items[j].back() != '\0') return "<not a text>";
+    return items[j].substr(0, items[j].size() - 1);
+}
+
+std::vector<TraceRecord> trace_records() {
+    std::vector<TraceRecord> out;
+    size_t n = trx_count();
+    for (size_t i = 0; i < n; ++i) {
+        TraceRecord r{};
+        int items = 0;
+        if (trx_record(i, &r.id, &r.kind, &items) != 0) break;
+        for (int j = 0; j < items; ++j) {
+            size_t len = 0;
+            const void *p = trx_item(i, j, &len);
+            r.items.emplace_back(static_cast<const char *>(p), len);
+        }
+        out.push_back(std::move(r));
+    }
+    return out;
+}
+
+std::vector<int> trace_ids() {
+    std::vector<int> ids;
+    for (const TraceRecord &r : trace_records()) ids.push_back(r.id);
+    return ids;
+}
+
+void set_trace_levels(unsigned char error, unsigned char api, unsigned char mapping, unsigned char milestone,
+                      unsigned char diag) {
+    const unsigned char levels[5] = {error, api, mapping, milestone, diag};
+    for (int i = 0; i < 5; ++i) trx_set_level("_SEI", i, levels[i]);
+}
+
+void reset_trace() {
+    set_trace_levels(0, 0, 0, 0, 0);
+    trx_clear();
+}
+
+void Test::SetUp() {
+    reset_trace();
+    clear_errors();
+    mssx_reset();
+    mssx_set_lock_wait_ms(200);
+    cux_set_clock(0);
+    cux_set_active_cluster(nullptr);
+    cux_fail_cluster_info(0);
+    fresh_config_dirs();
+}
+
+void Test::TearDown() {
+    reset_trace();
+    EXPECT_EQ(mssx_locks_held(), 0) << "a map file lock was left held";
+}
+
+int run_in_child(void (*body)(void *), void *arg) {
+    fflush(nullptr);
+    pid_t pid = fork();
+    if (pid == 0) {
+        body(arg);
+        _exit(0);
+    }
+    int status = 0;
+    waitpid(pid, &status, 0);
+    if (WIFEXITED(status)) return WEXITSTATUS(status);
+    return 128 + WTERMSIG(status);
+}
+
+}  // namespace oxtest

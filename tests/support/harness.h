@@ -1,0 +1,102 @@
+// Test harness shared by every test program: a private mount namespace with
+// fresh configuration directories, assertions on the last reported error
+// and on trace records, and the fault-injection hooks of the internal build.
+#ifndef OXIDM_TEST_HARNESS_H
+#define OXIDM_TEST_HARNESS_H
+
+#include <gtest/gtest.h>
+#include <sys/types.h>
+
+#include <cstdint>
+#include <string>
+#include <vector>
+
+#include "ox_cu.h"
+#include "ox_mss.h"
+#include "ox_tr.h"
+
+namespace oxtest {
+
+inline constexpr const char kVarCfg[] = "/var/ox/cfg";
+inline constexpr const char kOptCfg[] = "/opt/helvo/cfg";
+inline constexpr const char kLocalMap[] = "/var/ox/cfg/oxsec_map.local";
+inline constexpr const char kVarGlobalMap[] = "/var/ox/cfg/oxsec_map.global";
+inline constexpr const char kOptGlobalMap[] = "/opt/helvo/cfg/oxsec_map.global";
+inline constexpr const char kNodeInfo[] = "/var/ox/cfg/oxsec.nodeinfo";
+
+// Moves the process into a private mount namespace (as root; otherwise a user
+// namespace mapping the caller to root) where /var and /opt are overlays and
+// /var/ox/cfg and /opt/helvo/cfg are empty tmpfs mounts.  Must run before any
+// thread is started (the test main does it).  Returns false when namespaces
+// are not available; tests needing them then skip.
+bool enter_private_namespace();
+bool in_private_namespace();
+// Replaces both configuration directories by fresh, empty tmpfs mounts.
+void fresh_config_dirs();
+
+// Writes a file (creating it), optionally setting its modification time.
+void write_file(const std::string &path, const std::string &content, int64_t mtime = -1);
+void set_mtime(const std::string &path, int64_t mtime);
+void remove_file(const std::string &path);
+
+// Skips the current test unless the private namespace is active.
+#define OXTEST_REQUIRE_NAMESPACE()                                                   \
+    do {                                                                             \
+        if (!::oxtest::in_private_namespace()) GTEST_SKIP() << "no mount namespace"; \
+    } while (0)
+
+// ---- last reported error (libox_cu stand-in, this thread) ----
+struct Error {
+    int status;
+    int msgno;
+    std::vector<std::string> inserts;
+};
+// The current error of this thread, as recorded by cu_set_error_1.
+Error last_error();
+// Checks status, message number and every insert of the current error, and
+// that catalogue "oxseclib.cat", set 1 and reserved 0 were passed.
+::testing::AssertionResult reported(int status, int msgno, const std::vector<std::string> &inserts);
+// No cu_set_error_1 call since the last clear_errors().
+::testing::AssertionResult nothing_reported();
+void clear_errors();
+
+// ---- trace records (libox_tr stand-in) ----
+struct TraceRecord {
+    int id;
+    int kind;  // TRX_ID, TRX_DATA, TRX_STRINGS
+    std::vector<std::string> items;  // raw bytes, texts with their NUL
+    int32_t i32(size_t j) const;
+    uint64_t u64(size_t j) const;
+    std::string text(size_t j) const;  // without the NUL
+};
+std::vector<TraceRecord> trace_records();
+std::vector<int> trace_ids();
+// Levels of "_SEI": Error, API, Mapping, Milestone, Diag.
+void set_trace_levels(unsigned char error, unsigned char api, unsigned char mapping, unsigned char milestone,
+                      unsigned char diag);
+void reset_trace();  // all levels 0, records cleared
+
+// Base fixture: resets errors, traces, stand-in overrides and (when the
+// namespace is active) gives empty configuration directories.
+class Test : public ::testing::Test {
+  protected:
+    void SetUp() override;
+    void TearDown() override;
+};
+
+// Runs `body` in a child process; returns its exit status (or 128+signal).
+int run_in_child(void (*body)(void *), void *arg);
+
+}  // namespace oxtest
+
+#ifdef OXIDM_FAULT_INJECTION
+extern "C" {
+void idm_test_fail_alloc(long nth);  // the nth allocation from now fails (0: off)
+int idm_test_alloc_fired(void);
+long idm_test_alloc_calls(void);
+void idm_test_fail_mutex_init(int result);
+void idm_test_on_secret_free(void (*hook)(const void *, size_t));
+}
+#endif
+
+#endif
