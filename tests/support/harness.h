@@ -14,25 +14,9 @@
 #include "ox_cu.h"
 #include "ox_mss.h"
 #include "ox_tr.h"
+#include "namespace.h"
 
 namespace oxtest {
-
-inline constexpr const char kVarCfg[] = "/var/ox/cfg";
-inline constexpr const char kOptCfg[] = "/opt/helvo/cfg";
-inline constexpr const char kLocalMap[] = "/var/ox/cfg/oxsec_map.local";
-inline constexpr const char kVarGlobalMap[] = "/var/ox/cfg/oxsec_map.global";
-inline constexpr const char kOptGlobalMap[] = "/opt/helvo/cfg/oxsec_map.global";
-inline constexpr const char kNodeInfo[] = "/var/ox/cfg/oxsec.nodeinfo";
-
-// Moves the process into a private mount namespace (as root; otherwise a user
-// namespace mapping the caller to root) where /var and /opt are overlays and
-// /var/ox/cfg and /opt/helvo/cfg are empty tmpfs mounts.  Must run before any
-// thread is started (the test main does it).  Returns false when namespaces
-// are not available; tests needing them then skip.
-bool enter_private_namespace();
-bool in_private_namespace();
-// Replaces both configuration directories by fresh, empty tmpfs mounts.
-void fresh_config_dirs();
 
 // Writes a file (creating it), optionally setting its modification time.
 void write_file(const std::string &path, const std::string &content, int64_t mtime = -1);
