@@ -11,6 +11,7 @@
 #include <cstdlib>
 #include <cstring>
 #include <mutex>
+#include <set>
 #include <string>
 #include <vector>
 
@@ -31,7 +32,11 @@ namespace {
 thread_local bool t_pending = false;
 thread_local cu_error t_error;
 thread_local unsigned long t_count = 0;
-std::atomic<unsigned long> g_handles{0};
+// Handles handed out by cu_get_error_1 stay reachable from here until
+// released: a caller that keeps one for the life of the process (trace
+// registration does) does not leak it.
+std::mutex g_handle_mutex;
+std::set<cu_error *> *g_handles = new std::set<cu_error *>;  // never destroyed
 
 std::mutex g_mutex;
 bool g_cluster_override = false;
@@ -143,9 +148,11 @@ extern "C" int cu_set_error_1(int status, int reserved, const char *catalog, int
 extern "C" int cu_get_error_1(cu_error_t **handle) {
     if (!handle) return 4;
     if (!t_pending) return 0;
-    *handle = new (std::nothrow) cu_error(t_error);
-    if (!*handle) return 6;
-    g_handles.fetch_add(1);
+    cu_error *copy = new (std::nothrow) cu_error(t_error);
+    if (!copy) return 6;
+    std::lock_guard<std::mutex> lock(g_handle_mutex);
+    g_handles->insert(copy);
+    *handle = copy;
     return 0;
 }
 
@@ -158,8 +165,11 @@ extern "C" int cu_pset_error_1(const cu_error_t *handle) {
 
 extern "C" void cu_rel_error_1(cu_error_t *handle) {
     if (!handle) return;
+    {
+        std::lock_guard<std::mutex> lock(g_handle_mutex);
+        g_handles->erase(handle);
+    }
     delete handle;
-    g_handles.fetch_sub(1);
 }
 
 extern "C" int cu_gettimeofday_1(struct timeval *tv, void *tz) {
@@ -236,7 +246,10 @@ extern "C" unsigned long long cux_error_insert_raw(int i) {
     if (i < 1 || i > static_cast<int>(t_error.raw.size())) return 0;
     return t_error.raw[i - 1];
 }
-extern "C" unsigned long cux_handles_live(void) { return g_handles.load(); }
+extern "C" unsigned long cux_handles_live(void) {
+    std::lock_guard<std::mutex> lock(g_handle_mutex);
+    return g_handles->size();
+}
 extern "C" void cux_set_active_cluster(const char *name) {
     std::lock_guard<std::mutex> lock(g_mutex);
     g_cluster_override = name != nullptr;

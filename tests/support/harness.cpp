@@ -64,6 +64,8 @@ void clear_errors() {
     g_error_mark = cux_error_count();
 }
 
+unsigned long reports_since_clear() { return cux_error_count() - g_error_mark; }
+
 ::testing::AssertionResult nothing_reported() {
     if (cux_error_count() == g_error_mark) return ::testing::AssertionSuccess();
     Error e = last_error();

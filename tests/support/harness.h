@@ -43,6 +43,8 @@ Error last_error();
 // No cu_set_error_1 call since the last clear_errors().
 ::testing::AssertionResult nothing_reported();
 void clear_errors();
+// Number of cu_set_error_1 calls on this thread since the last clear_errors().
+unsigned long reports_since_clear();
 
 // ---- trace records (libox_tr stand-in) ----
 struct TraceRecord {
