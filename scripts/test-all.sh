@@ -1,0 +1,26 @@
+#!/bin/bash
+# Builds and runs every test: the whole suite as a plain debug build and under
+# ASan+UBSan, and the concurrency tests under TSan.  Installs missing Debian
+# packages first.  Warnings are errors here.
+set -euo pipefail
+cd "$(dirname "$0")/.."
+scripts/deps.sh
+jobs=$(nproc)
+werror=-DOXIDM_WERROR=ON
+status=0
+run_suite() {  # preset, ctest arguments...
+  local preset=$1; shift
+  echo "=== $preset: build" >&2
+  cmake --preset "$preset" $werror >/dev/null
+  cmake --build --preset "$preset" -j "$jobs"
+  echo "=== $preset: test" >&2
+  ctest --preset "$preset" -j "$jobs" --timeout 300 "$@" || status=1
+}
+run_suite debug
+run_suite asan-ubsan
+run_suite tsan
+if [[ -x fuzz/run-short.sh ]]; then
+  echo "=== fuzz: short runs" >&2
+  fuzz/run-short.sh || status=1
+fi
+exit $status
