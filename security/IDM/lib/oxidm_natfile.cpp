@@ -1,2 +1,786 @@
-// Placeholder; the module arrives with its issue.
+// Identity mapping files of the native mapping service.
+//
+// Owns three things, none of them guarded by a lock of its own:
+//   - the map file set of a translator (created here on first use, kept in
+//     the translator record, used only under that record's mutex);
+//   - the entry list a reading pass builds (a local of the pass until it is
+//     handed to the caller);
+//   - the open file of a pass: its descriptor, its stream and the shared
+//     file lock of libox_mss, held only while that one file is parsed.
+// The caller (the mapping walk) holds the translator's mutex for the whole
+// pass, so everything here runs on one thread at a time per translator.
+//
+// Cancellation: each of the three holds below is an RAII object whose
+// destructor is the named clean-up handler.  glibc cancels a C++ thread with
+// a forced unwind, so a pass cancelled while waiting for a file lock or
+// while reading a file releases the lock, closes the stream and frees the
+// entries parsed so far; the set stays with its translator.
+//
+// The line check is a pure function (idm::mapfile::judge_line and its parts)
+// that the file walk, the fuzzer and the checker tool share; the walk owns
+// the I/O, the locking and the trace points.
+#include "oxidm_natfile.h"
+
+#include <stdio_ext.h>
+
+#include <climits>
+
 #include "oxidm_internal.h"
+
+using namespace idm;
+
+namespace {
+
+// ---------------------------------------------------------------------------
+// Small helpers
+// ---------------------------------------------------------------------------
+
+constexpr bool is_blank(char c) { return c == ' ' || c == '\t'; }
+
+size_t skip_blanks(std::string_view s, size_t i) {
+    while (i < s.size() && is_blank(s[i])) ++i;
+    return i;
+}
+
+// End of an identifier: the first space or tab at or after i (and '=' when
+// `stop_at_equals`), or the end of the text.
+size_t token_end(std::string_view s, size_t i, bool stop_at_equals) {
+    while (i < s.size()) {
+        char c = s[i];
+        if (is_blank(c) || (stop_at_equals && c == '=')) break;
+        ++i;
+    }
+    return i;
+}
+
+bool only_blanks(std::string_view s) { return skip_blanks(s, 0) == s.size(); }
+
+// Reports 2650-651 for an internal routine and records its Error/Diag trace
+// point with the position and the low 32 bits of the value.
+int32_t bad_param(int32_t status, const char *function, int trace_id, int32_t position, uintptr_t value) {
+    if (trace::error_on()) {
+        uint32_t low = static_cast<uint32_t>(value);
+        trace::record_data(trace_id, trace::i32(position), trace::u32(low));
+    }
+    return report_bad_internal_param(status, function, position, hex(value));
+}
+
+uintptr_t addr(const void *p) { return reinterpret_cast<uintptr_t>(p); }
+
+// ---------------------------------------------------------------------------
+// Holds; each destructor is one of the named cancellation clean-ups
+// ---------------------------------------------------------------------------
+
+// A map file set being built; released unless handed over.
+class SetHold {
+  public:
+    SetHold() = default;
+    ~SetHold() {
+        if (set_ != nullptr) idm__thread_cleanup_cachef(set_);
+    }
+    void hold(idm_mapfile_set *set) { set_ = set; }
+    idm_mapfile_set *release() {
+        idm_mapfile_set *s = set_;
+        set_ = nullptr;
+        return s;
+    }
+    SetHold(const SetHold &) = delete;
+    SetHold &operator=(const SetHold &) = delete;
+
+  private:
+    idm_mapfile_set *set_ = nullptr;
+};
+
+// The entry list of a reading pass; freed unless handed over.
+class EntriesHold {
+  public:
+    EntriesHold() = default;
+    ~EntriesHold() {
+        if (armed_) idm__thread_cleanup_entries(&list_);
+    }
+    idm_entry_list &list() { return list_; }
+    void disarm() { armed_ = false; }
+    EntriesHold(const EntriesHold &) = delete;
+    EntriesHold &operator=(const EntriesHold &) = delete;
+
+  private:
+    idm_entry_list list_{nullptr, 0};
+    bool armed_ = true;
+};
+
+// One open map file of a reading pass; unlocked and closed unless the pass
+// released it itself.
+class MapfileHold {
+  public:
+    explicit MapfileHold(const char *path) {
+        std::memset(&file_, 0, sizeof file_);
+        file_.fd = -1;
+        size_t n = std::strlen(path);
+        if (n > IDM_MAPFILE_PATH_MAX) n = IDM_MAPFILE_PATH_MAX;
+        std::memcpy(file_.path, path, n);
+    }
+    ~MapfileHold() {
+        if (armed_) idm__thread_cleanup_mapfile(&file_);
+        explicit_bzero(file_.path, sizeof file_.path);
+    }
+    idm_open_mapfile &file() { return file_; }
+    void disarm() { armed_ = false; }
+    MapfileHold(const MapfileHold &) = delete;
+    MapfileHold &operator=(const MapfileHold &) = delete;
+
+  private:
+    idm_open_mapfile file_;
+    bool armed_ = true;
+};
+
+// The descriptor inside idm__ready_mapfile until it is handed to the caller:
+// closed (and unlocked once locked) on every other way out, including a
+// cancellation during the lock wait.
+class DescriptorHold {
+  public:
+    explicit DescriptorHold(int32_t fd) : fd_(fd) {}
+    ~DescriptorHold() { close(); }
+    void locked() { locked_ = true; }
+    void close() {
+        if (fd_ < 0) return;
+        if (locked_) sec__unlock_file(fd_, "idm__ready_mapfile");
+        locked_ = false;
+        sec__close_file(&fd_);
+        fd_ = -1;
+    }
+    void release() { fd_ = -1; }
+    DescriptorHold(const DescriptorHold &) = delete;
+    DescriptorHold &operator=(const DescriptorHold &) = delete;
+
+  private:
+    int fd_;
+    bool locked_ = false;
+};
+
+// A heap copy of an identifier until it is stored in an entry.
+class SecretCopy {
+  public:
+    SecretCopy() = default;
+    ~SecretCopy() { free_secret(p_); }
+    bool make(std::string_view s) {
+        p_ = static_cast<char *>(xmalloc(s.size() + 1));
+        if (p_ == nullptr) return false;
+        std::memcpy(p_, s.data(), s.size());
+        p_[s.size()] = '\0';
+        return true;
+    }
+    char *get() const { return p_; }
+    char *release() {
+        char *p = p_;
+        p_ = nullptr;
+        return p;
+    }
+    SecretCopy(const SecretCopy &) = delete;
+    SecretCopy &operator=(const SecretCopy &) = delete;
+
+  private:
+    char *p_ = nullptr;
+};
+
+// ---------------------------------------------------------------------------
+// Candidate files
+// ---------------------------------------------------------------------------
+
+struct Candidate {
+    const char *path;  // directory + file name
+    int site;          // allocation site number of its copy (trace 22)
+};
+constexpr Candidate kCandidates[IDM_MAPFILE_COUNT] = {
+    {"/var/ox/cfg/oxsec_map.local", 420},
+    {"/var/ox/cfg/oxsec_map.global", 434},
+    {"/opt/helvo/cfg/oxsec_map.global", 448},
+};
+
+const char *name_of(const idm_mapfile_set *set, int32_t i) {
+    return set->names != nullptr ? set->names[i] : nullptr;
+}
+
+}  // namespace
+
+// ---------------------------------------------------------------------------
+// The line check
+// ---------------------------------------------------------------------------
+
+namespace idm::mapfile {
+
+bool selects(std::string_view mechanism, std::string_view line) noexcept {
+    size_t start = skip_blanks(line, 0);
+    size_t colon = line.find(':', start);
+    if (colon == std::string_view::npos) return false;
+    return line.substr(start, colon - start) == mechanism;
+}
+
+LineVerdict judge_rule(std::string_view line) noexcept {
+    constexpr LineVerdict kInvalid{LineKind::kInvalid, {}, {}};
+    size_t colon = line.find(':');
+    if (colon == std::string_view::npos) return kInvalid;
+    size_t start = skip_blanks(line, colon + 1);
+    if (start == line.size()) return kInvalid;  // nothing but blanks after the colon
+    std::string_view rule = line.substr(start);
+
+    if (rule[0] == '!') {
+        // Denial: no '=' anywhere after the colon (only blanks stand between
+        // the colon and the rule), and an identifier after the '!'.
+        if (rule.find('=') != std::string_view::npos) return kInvalid;
+        size_t id = skip_blanks(rule, 1);
+        if (id == rule.size()) return kInvalid;
+        return {LineKind::kDenial, rule.substr(id, token_end(rule, id, true) - id), {}};
+    }
+
+    // Affirmative: network identifier, anything without '=', '=', blanks,
+    // local identifier.
+    size_t eq = rule.find('=');
+    if (eq == std::string_view::npos || eq == 0 || eq + 1 == rule.size()) return kInvalid;
+    size_t local = skip_blanks(rule, eq + 1);
+    if (local == rule.size()) return kInvalid;
+    return {LineKind::kAffirmative, rule.substr(0, token_end(rule, 0, true)),
+            rule.substr(local, token_end(rule, local, false) - local)};
+}
+
+namespace {
+// Line feed removal and comment cut: the line left to judge, or nothing when
+// it is empty or blank.
+bool prepare(std::string_view piece, std::string_view *line) {
+    size_t lf = piece.find('\n');
+    if (lf != std::string_view::npos) piece = piece.substr(0, lf);
+    size_t hash = piece.find('#');
+    if (hash != std::string_view::npos) piece = piece.substr(0, hash);
+    *line = piece;
+    return !only_blanks(piece);
+}
+}  // namespace
+
+LineVerdict judge_line(std::string_view mechanism, std::string_view piece) noexcept {
+    std::string_view line;
+    if (!prepare(piece, &line) || !selects(mechanism, line)) return {LineKind::kSkipped, {}, {}};
+    return judge_rule(line);
+}
+
+}  // namespace idm::mapfile
+
+extern "C" {
+
+// ---------------------------------------------------------------------------
+// Map file set
+// ---------------------------------------------------------------------------
+
+int32_t idm__native_get_mapfile_names(idm_mapfile_set **set_out) {
+    static constexpr const char kName[] = "idm__native_get_mapfile_names";
+    {
+        unsigned char l = trace::level(trace::kApi);
+        if (l == 1) {
+            trace::record_id(13);
+        } else if (l == 8) {
+            idm_mapfile_set *current = set_out != nullptr ? *set_out : nullptr;
+            trace::record_data(15, trace::ptr(set_out), trace::ptr(current));
+        }
+    }
+    // Exit: a bare id at level 1 and 8, then at level 8 each file of the
+    // stored set.
+    auto leave = [](int32_t status, const idm_mapfile_set *stored) {
+        unsigned char l = trace::level(trace::kApi);
+        if (l == 1 || l == 8) trace::record_id(16);
+        if (l == 8 && stored != nullptr)
+            for (int32_t i = 0; i < stored->count; ++i)
+                trace::record_data(17, trace::i32(i), trace::text(name_of(stored, i), "[null]"));
+        return status;
+    };
+
+    if (set_out == nullptr) return leave(bad_param(23, kName, 21, 1, 0), nullptr);
+
+    auto no_memory = [&](int site, size_t bytes) {
+        if (trace::error_on()) {
+            int32_t b = static_cast<int32_t>(bytes);
+            trace::record_data(22, trace::i32(site), trace::i32(b));
+        }
+        return leave(report_no_memory(kName, bytes), nullptr);
+    };
+
+    SetHold building;
+    auto *set = static_cast<idm_mapfile_set *>(xmalloc(sizeof(idm_mapfile_set)));
+    if (set == nullptr) return no_memory(367, sizeof(idm_mapfile_set));
+    *set = idm_mapfile_set{IDM_MAPFILE_SET_TAG, IDM_MAPFILE_COUNT, nullptr, nullptr, nullptr, nullptr};
+    building.hold(set);
+
+    set->names = static_cast<char **>(xcalloc(IDM_MAPFILE_COUNT, sizeof(char *)));
+    if (set->names == nullptr) return no_memory(388, IDM_MAPFILE_COUNT * sizeof(char *));
+    for (int32_t i = 0; i < IDM_MAPFILE_COUNT; ++i) {
+        set->names[i] = xstrdup(kCandidates[i].path);
+        if (set->names[i] == nullptr) return no_memory(kCandidates[i].site, std::strlen(kCandidates[i].path) + 1);
+    }
+    struct PerFile {
+        uint32_t *idm_mapfile_set::*field;
+        int site;
+    };
+    static constexpr PerFile kArrays[] = {
+        {&idm_mapfile_set::flags, 475}, {&idm_mapfile_set::mtimes, 488}, {&idm_mapfile_set::read_times, 501}};
+    for (const PerFile &a : kArrays) {
+        set->*a.field = static_cast<uint32_t *>(xcalloc(IDM_MAPFILE_COUNT, sizeof(uint32_t)));
+        if (set->*a.field == nullptr) return no_memory(a.site, IDM_MAPFILE_COUNT * sizeof(uint32_t));
+    }
+
+    *set_out = building.release();
+    return leave(0, *set_out);
+}
+
+void idm__native_release_cachef(idm_mapfile_set *set) {
+    if (set == nullptr || (set->tag >> 8) != IDM_MAPFILE_SET_MARK) return;
+    size_t count = set->count > 0 ? static_cast<size_t>(set->count) : 0;
+    if (set->names != nullptr) {
+        for (size_t i = 0; i < count; ++i) free_secret(set->names[i]);
+        free_zeroed(set->names, count * sizeof(char *));
+    }
+    free_zeroed(set->flags, count * sizeof(uint32_t));
+    free_zeroed(set->mtimes, count * sizeof(uint32_t));
+    free_zeroed(set->read_times, count * sizeof(uint32_t));
+    std::free(set);
+}
+
+void idm__thread_cleanup_cachef(void *set) {
+    if (set != nullptr) idm__native_release_cachef(static_cast<idm_mapfile_set *>(set));
+}
+
+// ---------------------------------------------------------------------------
+// One file: opening, reading, one line, the entry array
+// ---------------------------------------------------------------------------
+
+int32_t idm__ready_mapfile(const char *path, int32_t *fd, FILE **stream) {
+    static constexpr trace::ApiIds kIds{24, 26, 27, 29};
+    static constexpr const char kName[] = "idm__ready_mapfile";
+    trace::Api api(kIds, trace::text(path, "[null]"), trace::ptr(fd), trace::ptr(stream));
+    int32_t d = -1;
+    FILE *s = nullptr;
+    auto leave = [&](int32_t status) { return api.leave(status, trace::text(path, "[null]"), trace::i32(d), trace::ptr(s)); };
+    auto bad = [&](int32_t position, uintptr_t value) {
+        if (trace::error_on()) trace::record_data(35, trace::i32(position));
+        return leave(report_bad_internal_param(23, kName, position, hex(value)));
+    };
+    if (path == nullptr || path[0] == '\0') return bad(1, addr(path));
+    if (fd == nullptr) return bad(2, 0);
+    if (stream == nullptr) return bad(3, 0);
+
+    int r = sec__open_file(path, 0, &d);
+    if (trace::diag_on()) trace::record_data(30, trace::text(path), trace::i32(r), trace::i32(d));
+    switch (r) {
+    case 0: break;
+    case 12: d = -1; return leave(report(36, kMsg653, kName, path));
+    case 21: d = -1; return leave(37);
+    case 6: d = -1; return leave(report(36, kMsg654, kName, 0));
+    default: d = -1; return leave(report(23, kMsg655, "idm__open_mapfile", r, kName));
+    }
+    DescriptorHold hold(d);
+
+    r = sec__readlock_file(d, kName);
+    if (trace::diag_on()) trace::record_data(31, trace::text(path), trace::i32(r));
+    if (r != 0) {
+        hold.close();
+        d = -1;
+        if (r == 30) return leave(report(30, kMsg656, "idm__readlock_mapfile", path));
+        return leave(report(23, kMsg655, "idm__readlock_mapfile", r, kName));
+    }
+    hold.locked();
+
+    s = fdopen(d, "r");
+    if (s == nullptr) {
+        int e = errno;
+        char number[16];
+        std::snprintf(number, sizeof number, "%d", d);
+        hold.close();
+        if (trace::diag_on()) trace::record_data(34, trace::text(path), trace::i32(e), trace::ptr(s));
+        d = -1;
+        return leave(report(23, kMsg657, path, number, e));
+    }
+    if (trace::diag_on()) trace::record_id(32);
+    // The stream is this thread's alone: no stdio locking per line.
+    __fsetlocking(s, FSETLOCKING_BYCALLER);
+    hold.release();
+    *fd = d;
+    *stream = s;
+    return leave(0);
+}
+
+int32_t idm__parse_mapfile(const char *mechanism, const char *path, FILE *stream, int32_t *count,
+                           idm_mapfile_entry **entries) {
+    static constexpr trace::ApiIds kIds{36, 38, 39, 40};
+    static constexpr const char kName[] = "idm__parse_mapfile";
+    int32_t count_now = count != nullptr ? *count : 0;
+    trace::Api api(kIds, trace::ptr(stream), trace::ptr(count), trace::i32(count_now), trace::ptr(entries));
+    auto leave = [&](int32_t status) {
+        count_now = count != nullptr ? *count : 0;
+        return api.leave(status, trace::i32(count_now), trace::ptr(entries));
+    };
+    if (mechanism == nullptr || mechanism[0] == '\0') return leave(bad_param(23, kName, 47, 1, addr(mechanism)));
+    if (path == nullptr || path[0] == '\0') return leave(bad_param(23, kName, 47, 2, addr(path)));
+    if (stream == nullptr) return leave(bad_param(23, kName, 47, 3, 0));
+    if (count == nullptr) return leave(bad_param(23, kName, 47, 4, 0));
+    if (entries == nullptr) return leave(bad_param(23, kName, 47, 5, 0));
+
+    if (trace::diag_on()) trace::record_data(42, trace::text(path), trace::text(mechanism));
+    int32_t status = 0;
+    char piece[1024];
+    while (std::fgets(piece, sizeof piece, stream) != nullptr) {
+        if (trace::diag_on()) trace::record_data(43, trace::text(piece));
+        // The piece as a C string: whatever follows a NUL byte is not seen.
+        size_t n = std::strlen(piece);
+        if (n > 0 && piece[n - 1] == '\n') piece[--n] = '\0';
+        if (n == 0) {
+            if (trace::diag_on()) trace::record_id(44);
+            continue;
+        }
+        if (char *hash = static_cast<char *>(std::memchr(piece, '#', n))) {
+            *hash = '\0';
+            n = static_cast<size_t>(hash - piece);
+        }
+        if (only_blanks(std::string_view(piece, n)) || idm__test_entry_mech(mechanism, piece) != 0) {
+            if (trace::diag_on()) trace::record_id(45);
+            continue;
+        }
+        status = idm__read_mapfile_entries(piece, count, entries);
+        if (status != 0) break;
+    }
+    if (trace::diag_on()) trace::record_id(46);
+    return leave(status);
+}
+
+int32_t idm__test_entry_mech(const char *mechanism, const char *line) {
+    if (mechanism == nullptr || line == nullptr) return 1;
+    return mapfile::selects(mechanism, line) ? 0 : 1;
+}
+
+int32_t idm__read_mapfile_entries(const char *line, int32_t *count, idm_mapfile_entry **entries) {
+    static constexpr trace::ApiIds kIds{48, 50, 51, 53};
+    static constexpr const char kName[] = "idm__read_mapfile_entries";
+    int32_t count_now = count != nullptr ? *count : 0;
+    trace::Api api(kIds, trace::text(line, "<null string>"), trace::i32(count_now), trace::ptr(entries));
+    auto leave = [&](int32_t status) { return api.leave(status, trace::ptr(entries)); };
+    if (line == nullptr || line[0] == '\0') return leave(bad_param(23, kName, 59, 1, addr(line)));
+    if (count == nullptr) return leave(bad_param(23, kName, 59, 2, 0));
+    if (*count < 0) return leave(bad_param(23, kName, 59, 2, static_cast<uint32_t>(*count)));
+    if (entries == nullptr || (*count == 0 && *entries != nullptr))
+        return leave(bad_param(23, kName, 59, 3, addr(entries)));
+
+    mapfile::LineVerdict v = mapfile::judge_rule(line);
+    if (v.kind != mapfile::LineKind::kAffirmative && v.kind != mapfile::LineKind::kDenial) {
+        if (trace::diag_on()) trace::record_id(56);
+        return leave(0);
+    }
+    const bool denial = v.kind == mapfile::LineKind::kDenial;
+
+    auto no_memory = [&](int trace_id, size_t bytes) {
+        int32_t b = static_cast<int32_t>(bytes);
+        if (trace::error_on()) trace::record_data(trace_id, trace::i32(b));
+        return leave(report(23, kMsg658, kName, b));
+    };
+    SecretCopy network, local;
+    if (!network.make(v.network_id)) return no_memory(62, v.network_id.size() + 1);
+    if (!denial && !local.make(v.local_id)) return no_memory(65, v.local_id.size() + 1);
+
+    if (int32_t status = idm__alloc_entries(*count, entries); status != 0) return leave(status);
+
+    struct timeval now {};
+    cu_gettimeofday_1(&now, nullptr);
+    idm_mapfile_entry &e = (*entries)[*count];
+    e.read_time = static_cast<int64_t>(now.tv_sec);
+    e.kind = denial ? IDM_ENTRY_DENIAL : IDM_ENTRY_AFFIRMATIVE;
+    e.network_id = network.release();
+    e.local_id = local.release();
+    ++*count;
+    if (trace::diag_on())
+        trace::record_data(58, trace::i64(e.read_time),
+                           trace::text(denial ? "Denial of mapping" : "Affirmative mapping"),
+                           trace::text(e.network_id), trace::text(e.local_id, ""));
+    return leave(0);
+}
+
+int32_t idm__alloc_entries(int32_t count, idm_mapfile_entry **entries) {
+    if (count < 0) return bad_param(23, "idm__alloc_entries", 59, 1, static_cast<uint32_t>(count));
+    if (entries == nullptr) return bad_param(23, "idm__alloc_entries", 59, 2, 0);
+    if (count % 10 != 0) return 0;
+    // Exactly ten more slots each time: the capacity is always the smallest
+    // multiple of 10 not below the count.  glibc grows a large block in place
+    // (or by remapping) in the common case, which keeps a long file linear.
+    const size_t bytes = (static_cast<size_t>(count) + 10) * sizeof(idm_mapfile_entry);
+    int32_t bytes32 = static_cast<int32_t>(bytes);
+    if (trace::diag_on()) trace::record_data(55, trace::i32(count), trace::i32(bytes32));
+    void *grown = count <= INT32_MAX - 10 ? xrealloc(*entries, bytes) : nullptr;
+    if (grown == nullptr) {
+        if (trace::error_on()) trace::record_data(61, trace::i32(bytes32));
+        report(23, kMsg658, "idm_alloc_entries", bytes32);
+        return 6;
+    }
+    auto *array = static_cast<idm_mapfile_entry *>(grown);
+    std::memset(array + count, 0, 10 * sizeof(idm_mapfile_entry));
+    *entries = array;
+    return 0;
+}
+
+void idm__native_release_entry_list(int32_t count, idm_mapfile_entry *entries) {
+    if (count < 1 || entries == nullptr) return;
+    for (int32_t i = 0; i < count; ++i) {
+        free_secret(entries[i].network_id);
+        free_secret(entries[i].local_id);
+    }
+    std::free(entries);
+}
+
+void idm__thread_cleanup_entries(void *list) {
+    auto *l = static_cast<idm_entry_list *>(list);
+    if (l == nullptr || l->entries == nullptr) return;
+    for (int32_t i = 0; i < l->count; ++i) {
+        free_secret(l->entries[i].network_id);
+        free_secret(l->entries[i].local_id);
+    }
+    std::free(l->entries);
+    l->entries = nullptr;
+    l->count = 0;
+}
+
+void idm__thread_cleanup_mapfile(void *open_mapfile) {
+    auto *f = static_cast<idm_open_mapfile *>(open_mapfile);
+    if (f == nullptr || f->fd == -1) return;
+    if (trace::diag_on()) {
+        f->path[IDM_MAPFILE_PATH_MAX] = '\0';
+        trace::record_data(87, trace::text(f->path), trace::i32(f->fd), trace::ptr(f->stream));
+    }
+    sec__unlock_file(f->fd, "idm__thread_cleanup_mapfile");
+    if (f->stream != nullptr) {
+        std::fclose(f->stream);
+    } else {
+        int fd = f->fd;
+        sec__close_file(&fd);
+    }
+    explicit_bzero(f, sizeof *f);
+    f->fd = -1;
+}
+
+// ---------------------------------------------------------------------------
+// Change detection
+// ---------------------------------------------------------------------------
+
+int32_t idm__native_test_mapfiles_v1(idm_mapfile_set *set, int32_t index, int32_t superseder) {
+    static constexpr const char kName[] = "idm__native_test_mapfiles_v1";
+    {
+        unsigned char l = trace::level(trace::kApi);
+        if (l == 1 || l == 8) trace::record_id(67);
+    }
+    auto leave = [](int32_t result) {
+        unsigned char l = trace::level(trace::kApi);
+        if (l == 1) trace::record_id(78);
+        else if (l == 8) trace::record_data(79, trace::i32(result));
+        return result;
+    };
+    if (set == nullptr || set->names == nullptr || set->flags == nullptr || set->mtimes == nullptr ||
+        set->read_times == nullptr)
+        return leave(report_bad_internal_param(23, kName, 1, hex(set)));
+    if (index < 0 || index >= set->count)
+        return leave(report_bad_internal_param(23, kName, 2, hex(static_cast<uint32_t>(index))));
+    if (superseder < -1 || superseder >= set->count || superseder == index)
+        return leave(report_bad_internal_param(23, kName, 3, hex(static_cast<uint32_t>(superseder))));
+
+    const char *path = set->names[index];
+    uint32_t m = 0;
+    int r = sec__time_file(path, &m);
+    if (r != 0 && r != 21) return r;  // no exit record on a failed query
+
+    uint32_t &flags = set->flags[index];
+    uint32_t &mtime = set->mtimes[index];
+    uint32_t &read_time = set->read_times[index];
+    const bool diag = trace::diag_on();
+    auto note = [&](int id) {
+        if (diag) trace::record_data(id, trace::text(path, "[null]"));
+    };
+    auto note_superseded = [&]() {
+        if (diag) trace::record_data(71, trace::text(path, "[null]"), trace::text(set->names[superseder], "[null]"));
+    };
+    const bool superseded = superseder >= 0 && (set->flags[superseder] & MF_PRESENT) != 0;
+
+    if (r == 21) {
+        if ((flags & MF_PRESENT) == 0) {  // still absent
+            flags &= ~MF_REMOVED;
+            note(75);
+            return leave(1);
+        }
+        flags &= ~(MF_PRESENT | MF_IN_USE | MF_REREAD);  // removed
+        flags |= MF_REMOVED;
+        mtime = 0;
+        read_time = 0;
+        note(76);
+        return leave(0);
+    }
+
+    if ((flags & MF_PRESENT) == 0) {  // appeared
+        mtime = m;
+        note(68);
+        if (superseded) {
+            flags = MF_PRESENT;
+            note_superseded();
+            return leave(1);
+        }
+        flags = MF_PRESENT | MF_IN_USE | MF_REREAD;
+        note(69);
+        return leave(0);
+    }
+
+    note(72);  // still present
+    if (superseded) {
+        const bool unchanged_unread = m == mtime && mtime != read_time;
+        flags = MF_PRESENT;
+        mtime = m;
+        note_superseded();
+        if (unchanged_unread) note(75);
+        return leave(1);
+    }
+
+    flags = MF_PRESENT | MF_IN_USE;
+    note(73);
+    bool changed = true;
+    if (m != mtime) {
+        mtime = m;
+        flags |= MF_REREAD;
+        note(74);
+    } else if (mtime == read_time) {
+        // Parsed in the very second of the last change: a rewrite later in
+        // that second would not show, so read again.
+        flags |= MF_REREAD;
+        note(70);
+    } else {
+        changed = false;
+        note(75);
+    }
+    if (superseder >= 0 && (set->flags[superseder] & MF_REMOVED) != 0) {
+        flags |= MF_REREAD;
+        note(77);
+        return leave(0);
+    }
+    return leave(changed ? 0 : 1);
+}
+
+int32_t idm__native_test_mapfiles(idm_mapfile_set *set) {
+    static constexpr const char kName[] = "idm__native_test_mapfiles";
+    {
+        unsigned char l = trace::level(trace::kApi);
+        if (l == 1 || l == 8) trace::record_id(80);
+    }
+    auto leave = [](int32_t result) {
+        unsigned char l = trace::level(trace::kApi);
+        if (l == 1) trace::record_id(84);
+        else if (l == 8) trace::record_data(85, trace::i32(result));
+        return result;
+    };
+    auto deselect_all = [set]() {
+        if (set->flags == nullptr) return;
+        for (int32_t i = 0; i < set->count; ++i) set->flags[i] &= ~(MF_IN_USE | MF_REREAD);
+    };
+
+    if (set == nullptr) {
+        bad_param(4, kName, 81, 1, 0);
+        return leave(1);
+    }
+    if (uint32_t version = set->tag & 0xffu; version != IDM_MAPFILE_SET_VERSION) {
+        if (trace::error_on()) trace::record_data(82, trace::u32(version));
+        report(23, kMsg655, kName, 23, "[ignored]");
+        deselect_all();
+        return leave(1);
+    }
+
+    // File 2 is tested last: it reads the state the test of file 1 just left.
+    static constexpr int32_t kSuperseder[IDM_MAPFILE_COUNT] = {-1, -1, 1};
+    bool any_changed = false;
+    for (int32_t i = 0; i < IDM_MAPFILE_COUNT; ++i) {
+        int32_t r = idm__native_test_mapfiles_v1(set, i, kSuperseder[i]);
+        if (r == 0) {
+            any_changed = true;
+        } else if (r != 1) {
+            deselect_all();
+            return leave(any_changed ? 0 : 1);
+        }
+    }
+    if (trace::diag_on()) {
+        for (int32_t i = 0; i < IDM_MAPFILE_COUNT; ++i) {
+            uint32_t f = set->flags[i];
+            int32_t present = (f & MF_PRESENT) != 0, in_use = (f & MF_IN_USE) != 0;
+            int32_t removed = (f & MF_REMOVED) != 0, reread = (f & MF_REREAD) != 0;
+            trace::record_data(83, trace::i32(i), trace::text(name_of(set, i), "[null]"), trace::i32(present),
+                               trace::i32(in_use), trace::i32(removed), trace::i32(reread), trace::u32(set->mtimes[i]),
+                               trace::u32(set->read_times[i]));
+        }
+    }
+    return leave(any_changed ? 0 : 1);
+}
+
+// ---------------------------------------------------------------------------
+// Reading pass
+// ---------------------------------------------------------------------------
+
+int32_t idm__native_read_mapfiles(const char *mechanism, idm_mapfile_set **set, int32_t *count,
+                                  idm_mapfile_entry **entries) {
+    static constexpr const char kName[] = "idm__native_read_mapfiles";
+    {
+        unsigned char l = trace::level(trace::kApi);
+        if (l == 1 || l == 8) trace::record_id(4);
+    }
+    auto leave = [&](int32_t status) {
+        unsigned char l = trace::level(trace::kApi);
+        if (l == 1) {
+            trace::record_id(5);
+        } else if (l == 8) {
+            idm_mapfile_set *s = set != nullptr ? *set : nullptr;
+            int32_t c = count != nullptr ? *count : 0;
+            trace::record_data(12, trace::i32(status), trace::ptr(set), trace::ptr(s), trace::ptr(count), trace::i32(c),
+                               trace::ptr(entries));
+        }
+        return status;
+    };
+
+    EntriesHold building;  // the list this pass builds, freed unless handed over
+
+    if (mechanism == nullptr || mechanism[0] == '\0') return leave(bad_param(23, kName, 6, 1, addr(mechanism)));
+    if (set == nullptr) return leave(bad_param(23, kName, 6, 2, 0));
+    if (count == nullptr) return leave(bad_param(23, kName, 6, 3, 0));
+    if (entries == nullptr) return leave(bad_param(23, kName, 6, 4, 0));
+    if (trace::level(trace::kApi) == 8 || trace::diag_on())
+        trace::record_data(8, trace::text(mechanism), trace::ptr(set), trace::ptr(*set), trace::ptr(count),
+                           trace::i32(*count), trace::ptr(entries), trace::ptr(*entries));
+
+    if (*set == nullptr)
+        if (int32_t status = idm__native_get_mapfile_names(set); status != 0) return leave(status);
+    idm_mapfile_set *files = *set;
+    if (int32_t r = idm__native_test_mapfiles(files); r != 0) return leave(r);
+
+    idm_entry_list &list = building.list();
+    for (int32_t i = 0; i < files->count; ++i) {
+        if ((files->flags[i] & MF_IN_USE) == 0) continue;
+        MapfileHold hold(files->names[i]);
+        idm_open_mapfile &open = hold.file();
+        int32_t status = idm__ready_mapfile(open.path, &open.fd, &open.stream);
+        if (status == 0) {
+            if (trace::diag_on()) trace::record_data(9, trace::text(open.path));
+            status = idm__parse_mapfile(mechanism, open.path, open.stream, &list.count, &list.entries);
+            sec__unlock_file(open.fd, kName);
+            FILE *stream = open.stream;
+            open.stream = nullptr;
+            open.fd = -1;
+            std::fclose(stream);
+        }
+        hold.disarm();
+        if (status != 0) return leave(status);  // the hold of the list frees it
+
+        struct timeval now {};
+        cu_gettimeofday_1(&now, nullptr);
+        files->read_times[i] = static_cast<uint32_t>(now.tv_sec);
+        files->flags[i] &= ~MF_REREAD;
+    }
+
+    idm__native_release_entry_list(*count, *entries);
+    *count = list.count;
+    *entries = list.entries;
+    building.disarm();
+    return leave(0);
+}
+
+}  // extern "C"
