@@ -8,9 +8,11 @@
 // refresh and again for the walk (including every call into the MPM).
 // Records are never freed, so a record found under the native mutex stays
 // valid after it is released.
+#include <grp.h>
+#include <pwd.h>
+#include <unistd.h>
+
 #include "oxidm_internal.h"
-#include "oxidm_natfile.h"
-#include "oxidm_natmap.h"
 
 using namespace idm;
 
@@ -103,122 +105,216 @@ idm_translator *idm__native_find_translator(const char *mnemonic) {
 // Native identity mapping
 // ---------------------------------------------------------------------------
 
-// Releases an entry list detached from a record when the scope ends; no
-// call into an MPM happens here, so it is safe during a cancellation unwind.
-struct idm_entry_list_release {
-    int32_t count;
-    idm_mapfile_entry *entries;
-    ~idm_entry_list_release() { idm__native_release_entry_list(count, entries); }
-};
-
-// Maps `network_id` of mechanism `mnemonic` to a local user in `local`
-// (cleared by the caller; written only by a matching rule).  Returns
-//   0   the first matching entry's local name in `local` (the caller frees
-//       local->value), or `local` empty: the first match was a denial, no
-//       entry matched and the last translation succeeded, or no entry was
-//       translated at all;
-//   22  no translator registered under `mnemonic` (2650-660);
-//   >1  the map files could not be read (reported there); the record is
-//       left without entries and rules;
-//   31  the translator stopped the walk;
-//   otherwise the status of the last translator call, when nothing matched.
-// The record's mutex is held for the refresh and again for the walk,
-// including every call of the MPM's routines; the holds are released if the
-// thread is cancelled inside one of them.
 int32_t idm__native_map_identity(const char *mnemonic, const char *network_id, idm_buffer *local) {
     static constexpr trace::ApiIds kIds{108, 110, 111, 112};
     trace::Api api(kIds, trace::text(mnemonic), trace::text(network_id), trace::ptr(local));
     pthread_once(&idm__native_init_once_block, idm__native_state_init);
     idm_translator *record = idm__native_find_translator(mnemonic);
     if (record == nullptr) return api.leave(report(22, kMsg660, mnemonic));
-
-    // Refresh.  After a change or a read error the old entries and rules
-    // go, and a new list is installed within the same hold.  The old ones
-    // are detached before the MPM's cleanup routine sees them, so a thread
-    // cancelled inside it leaves the record consistent.
-    int32_t read_status;
-    {
-        MutexHold hold(&record->mutex);
-        int32_t count = 0;
-        idm_mapfile_entry *entries = nullptr;
-        read_status = idm__native_read_mapfiles(mnemonic, &record->mapfiles, &count, &entries);
-        if (read_status != 1) {
-            idm_entry_list_release old_entries{record->entry_count, record->entries};
-            int32_t old_rule_count = record->rule_count;
-            idm_rule *old_rules = record->rules;
-            record->rule_count = 0;
-            record->rules = nullptr;
-            record->entry_count = 0;
-            record->entries = nullptr;
-            if (read_status == 0) {
-                record->entry_count = count;
-                record->entries = entries;
-            }
-            idm__native_release_rule_list(record->cleanup, old_rule_count, old_rules);
-        }
-    }
-    if (read_status > 1) return api.leave(read_status);
-
-    // Walk, first match wins.  A cached rule gets only the id translated;
-    // an unusable one costs the state test.  A new rule is cached whatever
-    // its verdict for statuses 0, 31, 38 and 39; the cache then owns its
-    // contents and only the id is released.
-    int32_t status = 0;
-    {
-        MutexHold hold(&record->mutex);
-        const idm_translator_routine translate = record->translator;
-        const idm_cleanup_routine cleanup = record->cleanup;
-        idm_id id{};
-        const int32_t n = record->entry_count;
-        for (int32_t i = 0; i < n; ++i) {
-            idm_mapfile_entry *entry = &record->entries[i];
-            idm_rule rule{};
-            int32_t match = -1;
-            if (int32_t k = entry->rule_index; k != 0) {
-                if (k < 0 || k > record->rule_count) continue;
-                idm_rule *cached = &record->rules[k - 1];
-                if ((cached->rule_state & 0xFFFEu) != 0) continue;
-                status = translate(nullptr, network_id, cached, &id);
-                if (status == 0) match = idm__native_apply_rule(cached, &id, local);
-                (void)cleanup(nullptr, &id);
-            } else {
-                status = translate(entry, network_id, &rule, &id);
-                switch (status) {
-                case 0:
-                    match = idm__native_apply_rule(&rule, &id, local);
-                    break;
-                case 39:
-                    (void)cleanup(&rule, nullptr);
-                    rule = idm_rule{};
-                    rule.rule_state = IDM_RULE_MULTI_WILDCARD;
-                    break;
-                case 38:
-                case 31:
-                    (void)idm__native_check_rule(&rule);
-                    break;
-                default:
-                    continue;
-                }
-                if (idm__native_cache_rule(record, entry, &rule) == 0) (void)cleanup(nullptr, &id);
-                else (void)cleanup(&rule, &id);
-            }
-            if (status == 31 || (status == 0 && match == 0)) break;
-        }
-    }
-    return api.leave(status);
+    // The refresh and the walk arrive with the map file and rule modules.
+    return api.leave(0);
 }
 
 // ---------------------------------------------------------------------------
 // Group membership lookup
 // ---------------------------------------------------------------------------
 
+// The system's group enumeration (setgrent, getgrent_r, endgrent) keeps one
+// position for the whole process, so two scans at once would each see only
+// part of the database.  This mutex serialises the scans of the library: it
+// is held from setgrent to endgrent and no other lock is taken under it, so
+// it stands outside the lock order above.  Code outside the library that
+// enumerates groups is not covered (the public header says so).
+static pthread_mutex_t idm__native_group_scan_mutex = PTHREAD_MUTEX_INITIALIZER;
+
+// Cancellation clean-up of a group scan: closes the enumeration and releases
+// the scan mutex.  endgrent may be a cancellation point and this runs inside
+// a destructor (possibly during the unwind of a cancellation), so it runs
+// with cancellation disabled.
+static void idm__thread_cleanup_group_scan(void *mutex) {
+    int old_state = 0;
+    pthread_setcancelstate(PTHREAD_CANCEL_DISABLE, &old_state);
+    endgrent();
+    pthread_setcancelstate(old_state, nullptr);
+    idm__thread_cleanup_mutex(mutex);
+}
+
+namespace {
+
+constexpr const char kGroupsName[] = "idm__native_get_groups";
+
+// Working size of a lookup buffer when sysconf gives no suggestion (-1):
+// 16 KiB holds any ordinary entry; a longer one fails its lookup as it would
+// when it exceeds a suggested size.
+constexpr int32_t kUnsuggestedSize = 16384;
+
+// The suggested buffer size for `which`, taken as a 32-bit signed number.
+size_t suggested_size(int which) {
+    int32_t n = static_cast<int32_t>(sysconf(which));
+    return static_cast<size_t>(n > 0 ? n : kUnsuggestedSize);
+}
+
+// The error number of a failed getgrent_r.  glibc returns it as the result
+// and may leave errno alone; an interposed database may return -1 and set
+// errno instead.  A positive result is the error number; otherwise errno,
+// which the caller cleared before the call, holds it (0: nothing failed).
+int enumeration_error(int result) { return result > 0 ? result : errno; }
+
+// Holds the group-scan mutex for one enumeration; the destructor (normal
+// exit or cancellation) calls endgrent and unlocks.
+class GroupScanHold {
+  public:
+    GroupScanHold() { pthread_mutex_lock(&idm__native_group_scan_mutex); }
+    ~GroupScanHold() { idm__thread_cleanup_group_scan(&idm__native_group_scan_mutex); }
+    GroupScanHold(const GroupScanHold &) = delete;
+    GroupScanHold &operator=(const GroupScanHold &) = delete;
+};
+
+// A lookup work buffer.  It holds database entries (user names, home
+// directories), so it is zeroed before it is freed, also on cancellation.
+struct WorkBuffer {
+    char *p = nullptr;
+    size_t n = 0;
+    WorkBuffer() = default;
+    WorkBuffer(const WorkBuffer &) = delete;
+    WorkBuffer &operator=(const WorkBuffer &) = delete;
+    ~WorkBuffer() { release(); }
+    // 0, or 6 (2650-654 with the size).
+    int32_t allocate(size_t size) {
+        p = static_cast<char *>(xmalloc(size));
+        if (p == nullptr) return report_no_memory(kGroupsName, size);
+        n = size;
+        return 0;
+    }
+    void release() {
+        free_zeroed(p, n);
+        p = nullptr;
+        n = 0;
+    }
+};
+
+// The result array under construction.  Unless handed over, the destructor
+// frees every element's value and then the array.
+struct GroupList {
+    idm_buffer *items = nullptr;
+    uint32_t count = 0;
+    GroupList() = default;
+    GroupList(const GroupList &) = delete;
+    GroupList &operator=(const GroupList &) = delete;
+    ~GroupList() {
+        for (uint32_t i = 0; i < count; ++i) std::free(items[i].value);
+        std::free(items);
+    }
+    // Appends a zeroed element and copies `name` into it.  Returns 0 or 6
+    // (2650-654): when the array cannot grow it stays as it was; when the
+    // name cannot be copied the zeroed element stays, counted.
+    int32_t append(const char *name) {
+        size_t bytes = (static_cast<size_t>(count) + 1) * sizeof(idm_buffer);
+        void *grown = items == nullptr ? xmalloc(bytes) : xrealloc(items, bytes);
+        if (grown == nullptr) return report_no_memory(kGroupsName, bytes);
+        items = static_cast<idm_buffer *>(grown);
+        idm_buffer *added = &items[count++];
+        std::memset(added, 0, sizeof *added);
+        size_t length = std::strlen(name) + 1;
+        added->value = xstrdup(name);
+        if (added->value == nullptr) return report_no_memory(kGroupsName, length);
+        added->length = static_cast<uint32_t>(length);
+        return 0;
+    }
+};
+
+// User lookup and primary group: on 0, `list` holds the primary group as its
+// only element unless the user's primary group id is -1 (`*primary` tells).
+// Returns 0, 6 (2650-654) or 15 (2650-698, 2650-699).
+int32_t lookup_primary_group(const char *name, size_t pw_size, size_t gr_size, GroupList &list, bool *primary) {
+    WorkBuffer user_buffer;
+    if (int32_t status = user_buffer.allocate(2 * pw_size); status != 0) return status;
+    passwd pwd;
+    passwd *user = nullptr;
+    int result = getpwnam_r(name, &pwd, user_buffer.p, user_buffer.n, &user);
+    if (result != 0 || user == nullptr || std::strncmp(pwd.pw_name, name, pw_size) != 0)
+        return report(15, kMsg698, name);
+    if (pwd.pw_gid == static_cast<gid_t>(-1)) return 0;
+
+    WorkBuffer group_buffer;
+    if (int32_t status = group_buffer.allocate(gr_size); status != 0) return status;
+    group grp;
+    group *found = nullptr;
+    result = getgrgid_r(pwd.pw_gid, &grp, group_buffer.p, group_buffer.n, &found);
+    if (result != 0 || found == nullptr) return report(15, kMsg699, static_cast<int>(pwd.pw_gid));
+    list.items = static_cast<idm_buffer *>(xcalloc(1, sizeof(idm_buffer)));
+    if (list.items == nullptr) return report_no_memory(kGroupsName, sizeof(idm_buffer));
+    size_t length = std::strlen(grp.gr_name) + 1;
+    list.items[0].value = xstrdup(grp.gr_name);
+    if (list.items[0].value == nullptr) return report_no_memory(kGroupsName, length);
+    list.items[0].length = static_cast<uint32_t>(length);
+    list.count = 1;
+    *primary = true;
+    return 0;
+}
+
+// One pass over the group database, appending every group whose member list
+// names `name`, once per naming.  Returns the status of the last failure
+// recorded: 0, 6 (2650-654, the scan went on) or 15 (2650-700, it ended).
+int32_t scan_groups(const char *name, size_t gr_size, bool primary, GroupList &list) {
+    WorkBuffer scan_buffer;
+    if (int32_t status = scan_buffer.allocate(gr_size); status != 0) return status;
+    int32_t status = 0;
+    GroupScanHold scan;  // destroyed first: endgrent and unlock, then the buffer
+    setgrent();
+    for (;;) {
+        group grp;
+        group *found = nullptr;
+        errno = 0;
+        int result = getgrent_r(&grp, scan_buffer.p, scan_buffer.n, &found);
+        if (result != 0) {
+            int error = enumeration_error(result);
+            if (error == EINTR) continue;
+            if (error != 0 && error != ENOENT) status = report(15, kMsg700, error);
+            break;
+        }
+        if (found == nullptr) break;
+        if (primary && std::strcmp(grp.gr_name, list.items[0].value) == 0) continue;
+        if (grp.gr_mem == nullptr) continue;
+        for (char **member = grp.gr_mem; *member != nullptr; ++member) {
+            if (std::strcmp(*member, name) != 0) continue;
+            if (int32_t appended = list.append(grp.gr_name); appended != 0) {
+                status = appended;  // go on with the next group
+                break;
+            }
+        }
+    }
+    return status;
+}
+
+}  // namespace
+
+// The groups of local user user->value: the primary group first (none when
+// the primary group id is -1), then every group whose member list names the
+// user, in enumeration order, once per naming; the primary group is not
+// repeated.  On 0 the caller owns *groups (null when *count is 0) and frees
+// each element's value, then the array.  Returns 0, 6 (2650-654) or 15
+// (2650-698, 2650-699, 2650-700); on failure *count is 0 and *groups null
+// and nothing of the call stays allocated.
 int32_t idm__native_get_groups(idm_buffer *user, uint32_t *count, idm_buffer **groups) {
     static constexpr trace::ApiIds kIds{113, 115, 116, 117};
     trace::Api api(kIds, trace::ptr(user), trace::ptr(count), trace::ptr(groups));
     *count = 0;
     *groups = nullptr;
-    // The database walk arrives with the group module.
-    return api.leave(0);
+    const size_t pw_size = suggested_size(_SC_GETPW_R_SIZE_MAX);
+    const size_t gr_size = suggested_size(_SC_GETGR_R_SIZE_MAX);
+
+    GroupList list;
+    bool primary = false;
+    int32_t status = lookup_primary_group(user->value, pw_size, gr_size, list, &primary);
+    if (status == 0) status = scan_groups(user->value, gr_size, primary, list);
+    if (status == 0 && list.count != 0) {
+        *groups = list.items;
+        *count = list.count;
+        list.items = nullptr;
+        list.count = 0;
+    }
+    return api.leave(status);
 }
 
 }  // extern "C"
