@@ -13,6 +13,8 @@
 #include <unistd.h>
 
 #include "oxidm_internal.h"
+#include "oxidm_natfile.h"
+#include "oxidm_natmap.h"
 
 using namespace idm;
 
@@ -105,14 +107,109 @@ idm_translator *idm__native_find_translator(const char *mnemonic) {
 // Native identity mapping
 // ---------------------------------------------------------------------------
 
+// Releases an entry list detached from a record when the scope ends; no
+// call into an MPM happens here, so it is safe during a cancellation unwind.
+struct idm_entry_list_release {
+    int32_t count;
+    idm_mapfile_entry *entries;
+    ~idm_entry_list_release() { idm__native_release_entry_list(count, entries); }
+};
+
+// Maps `network_id` of mechanism `mnemonic` to a local user in `local`
+// (cleared by the caller; written only by a matching rule).  Returns
+//   0   the first matching entry's local name in `local` (the caller frees
+//       local->value), or `local` empty: the first match was a denial, no
+//       entry matched and the last translation succeeded, or no entry was
+//       translated at all;
+//   22  no translator registered under `mnemonic` (2650-660);
+//   >1  the map files could not be read (reported there); the record is
+//       left without entries and rules;
+//   31  the translator stopped the walk;
+//   otherwise the status of the last translator call, when nothing matched.
+// The record's mutex is held for the refresh and again for the walk,
+// including every call of the MPM's routines; the holds are released if the
+// thread is cancelled inside one of them.
 int32_t idm__native_map_identity(const char *mnemonic, const char *network_id, idm_buffer *local) {
     static constexpr trace::ApiIds kIds{108, 110, 111, 112};
     trace::Api api(kIds, trace::text(mnemonic), trace::text(network_id), trace::ptr(local));
     pthread_once(&idm__native_init_once_block, idm__native_state_init);
     idm_translator *record = idm__native_find_translator(mnemonic);
     if (record == nullptr) return api.leave(report(22, kMsg660, mnemonic));
-    // The refresh and the walk arrive with the map file and rule modules.
-    return api.leave(0);
+
+    // Refresh.  After a change or a read error the old entries and rules
+    // go, and a new list is installed within the same hold.  The old ones
+    // are detached before the MPM's cleanup routine sees them, so a thread
+    // cancelled inside it leaves the record consistent.
+    int32_t read_status;
+    {
+        MutexHold hold(&record->mutex);
+        int32_t count = 0;
+        idm_mapfile_entry *entries = nullptr;
+        read_status = idm__native_read_mapfiles(mnemonic, &record->mapfiles, &count, &entries);
+        if (read_status != 1) {
+            idm_entry_list_release old_entries{record->entry_count, record->entries};
+            int32_t old_rule_count = record->rule_count;
+            idm_rule *old_rules = record->rules;
+            record->rule_count = 0;
+            record->rules = nullptr;
+            record->entry_count = 0;
+            record->entries = nullptr;
+            if (read_status == 0) {
+                record->entry_count = count;
+                record->entries = entries;
+            }
+            idm__native_release_rule_list(record->cleanup, old_rule_count, old_rules);
+        }
+    }
+    if (read_status > 1) return api.leave(read_status);
+
+    // Walk, first match wins.  A cached rule gets only the id translated;
+    // an unusable one costs the state test.  A new rule is cached whatever
+    // its verdict for statuses 0, 31, 38 and 39; the cache then owns its
+    // contents and only the id is released.
+    int32_t status = 0;
+    {
+        MutexHold hold(&record->mutex);
+        const idm_translator_routine translate = record->translator;
+        const idm_cleanup_routine cleanup = record->cleanup;
+        idm_id id{};
+        const int32_t n = record->entry_count;
+        for (int32_t i = 0; i < n; ++i) {
+            idm_mapfile_entry *entry = &record->entries[i];
+            idm_rule rule{};
+            int32_t match = -1;
+            if (int32_t k = entry->rule_index; k != 0) {
+                if (k < 0 || k > record->rule_count) continue;
+                idm_rule *cached = &record->rules[k - 1];
+                if ((cached->rule_state & 0xFFFEu) != 0) continue;
+                status = translate(nullptr, network_id, cached, &id);
+                if (status == 0) match = idm__native_apply_rule(cached, &id, local);
+                (void)cleanup(nullptr, &id);
+            } else {
+                status = translate(entry, network_id, &rule, &id);
+                switch (status) {
+                case 0:
+                    match = idm__native_apply_rule(&rule, &id, local);
+                    break;
+                case 39:
+                    (void)cleanup(&rule, nullptr);
+                    rule = idm_rule{};
+                    rule.rule_state = IDM_RULE_MULTI_WILDCARD;
+                    break;
+                case 38:
+                case 31:
+                    (void)idm__native_check_rule(&rule);
+                    break;
+                default:
+                    continue;
+                }
+                if (idm__native_cache_rule(record, entry, &rule) == 0) (void)cleanup(nullptr, &id);
+                else (void)cleanup(&rule, &id);
+            }
+            if (status == 31 || (status == 0 && match == 0)) break;
+        }
+    }
+    return api.leave(status);
 }
 
 // ---------------------------------------------------------------------------
