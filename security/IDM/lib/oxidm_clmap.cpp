@@ -1,21 +1,718 @@
-// Cluster membership: the node information file, its two search trees and
-// the exported queries.  (Placeholder until the cluster module lands.)
+// Cluster map: the node information file, its two search trees, and the
+// exported membership queries (see oxidm_clmap.h for the state and its
+// guards).
+//
+// A query holds idmutex as a read share from before its lookup until it has
+// read the returned cluster names.  The load step runs under that share:
+// stat, the comparison with lastmod, open, read and the working lists happen
+// with the read share; every change of the trees happens between a
+// promotion and a demotion, with thread cancellation disabled so that a
+// rebuild is never left half done.  Since promotion gives up the read share
+// before it waits, another thread may reload in between; each reload
+// rebuilds both trees from scratch, so the last one wins.
+//
+// The file is read whole with one read() into a buffer of its size + 1, an
+// LF is appended, and parse() judges the text in place.  Values are copied
+// once out of the text, and the record's cluster list once more into each
+// tree record.
+#include "oxidm_clmap.h"
+
+#include <arpa/inet.h>
+#include <fcntl.h>
+#include <netinet/in.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <cctype>
+#include <memory>
+
 #include "oxidm_internal.h"
+
+using namespace idm;
+
+extern "C" {
+rst_tree nametree;
+rst_tree iptree;
+int64_t lastmod;
+sec_rwlock idmutex;
+}
+
+namespace idm::clmap {
+namespace {
+
+constexpr trace::ApiIds kNamesIds{150, 151, 152, 153};
+constexpr trace::ApiIds kActiveIds{140, 141, 142, 143};
+constexpr trace::ApiIds kAnyIds{144, 145, 146, 147};
+constexpr const char kNullHost[] = "<null string>";
+constexpr const char kNullValue[] = "[null!]";
+
+constexpr int32_t kListStep = 32;  // working lists start with and grow by 32 entries
+
+// lastmod after a load that was abandoned by cancellation: no file has this
+// time, so the next query loads again.
+constexpr int64_t kForceReload = INT64_MIN;
+
+int64_t load_lastmod() { return __atomic_load_n(&lastmod, __ATOMIC_RELAXED); }
+void store_lastmod(int64_t t) { __atomic_store_n(&lastmod, t, __ATOMIC_RELAXED); }
+
+bool is_space(char c) { return std::isspace(static_cast<unsigned char>(c)) != 0; }
+
+// Trace point 163: the allocation site and the bytes asked for.
+enum AllocSite : int32_t { kSiteNames = 1, kSiteAddresses, kSiteClusters, kSiteGrowNames, kSiteGrowAddresses,
+                           kSiteGrowClusters };
+
+void trace_alloc_failure(int32_t site, size_t bytes) {
+    if (!trace::error_on()) return;
+    const int64_t asked = static_cast<int64_t>(bytes);
+    trace::record_data(163, trace::i32(site), trace::i64(asked));
+}
+
+// Empties both trees; the caller holds the write hold.
+void clean_trees() {
+    if (nametree.rst_node_cnt != 0) sec__rst_clean(&nametree);
+    if (iptree.rst_node_cnt != 0) sec__rst_clean(&iptree);
+}
+
+// Disables thread cancellation for the scope: a rebuild of the trees runs to
+// its end once it has begun.
+class NoCancel {
+  public:
+    NoCancel() { pthread_setcancelstate(PTHREAD_CANCEL_DISABLE, &old_); }
+    ~NoCancel() { pthread_setcancelstate(old_, nullptr); }
+    NoCancel(const NoCancel &) = delete;
+    NoCancel &operator=(const NoCancel &) = delete;
+
+  private:
+    int old_ = PTHREAD_CANCEL_ENABLE;
+};
+
+// The descriptor of the file being read; closed at the end of the scope.
+class FileHold {
+  public:
+    explicit FileHold(int fd) : fd_(fd) {}
+    ~FileHold() { close(); }
+    int fd() const { return fd_; }
+    void close() {
+        if (fd_ >= 0) ::close(fd_);
+        fd_ = -1;
+    }
+    FileHold(const FileHold &) = delete;
+    FileHold &operator=(const FileHold &) = delete;
+
+  private:
+    int fd_;
+};
+
+// Armed while a load has stored the new lastmod but not yet finished: if the
+// thread is cancelled meanwhile, the next query loads the file again.
+class ReloadUnlessDone {
+  public:
+    ~ReloadUnlessDone() {
+        if (armed_) store_lastmod(kForceReload);
+    }
+    void done() { armed_ = false; }
+
+  private:
+    bool armed_ = true;
+};
+
+// ---- the pure parser ----
+
+struct KeywordEntry {
+    std::string_view text;
+    Keyword keyword;
+};
+constexpr KeywordEntry kKeywords[] = {
+    {"NODE", Keyword::kNode}, {"NAME", Keyword::kName}, {"ADDRESS", Keyword::kAddress}, {"CLUSTER", Keyword::kCluster}};
+
+struct AttrRule {
+    Attr attr;
+    size_t keyword_length;
+    int not_allowed_point;  // outside a record, or already given
+    int no_colon_point;
+};
+constexpr AttrRule kNameRule{kNames, 4, 165, 166};
+constexpr AttrRule kAddressRule{kAddresses, 7, 167, 168};
+constexpr AttrRule kClusterRule{kClusters, 7, 169, 170};
+
+// Walks a text; caches the end of the current line so that every search
+// for ":" and LF stays within one pass over the line.
+class Cursor {
+  public:
+    explicit Cursor(std::string_view text) : text_(text) {}
+
+    // Offset of the LF that ends the line holding `pos` (or the text's size).
+    size_t line_end(size_t pos) {
+        if (pos >= line_end_ || pos < line_begin_) {
+            const void *lf = std::memchr(text_.data() + pos, '\n', text_.size() - pos);
+            line_begin_ = pos;
+            line_end_ = lf != nullptr ? static_cast<size_t>(static_cast<const char *>(lf) - text_.data()) : text_.size();
+        }
+        return line_end_;
+    }
+    // Offset of the first ":" in [from, end of line), or npos.
+    size_t colon(size_t from) {
+        size_t end = line_end(from);
+        const void *c = std::memchr(text_.data() + from, ':', end - from);
+        return c != nullptr ? static_cast<size_t>(static_cast<const char *>(c) - text_.data()) : std::string_view::npos;
+    }
+
+  private:
+    std::string_view text_;
+    size_t line_begin_ = 0;
+    size_t line_end_ = 0;
+};
+
+struct Record {
+    bool open = false;
+    int32_t count[3] = {0, 0, 0};  // values given per attribute
+    size_t offset = 0;             // where its NODE statement begins
+    size_t line = 0;
+    bool complete() const { return count[kClusters] != 0 && (count[kNames] != 0 || count[kAddresses] != 0); }
+};
+
+}  // namespace
+
+Keyword keyword_of(std::string_view statement) {
+    for (const KeywordEntry &k : kKeywords)
+        if (statement.size() >= k.text.size() &&
+            cu_8bit_strncasecmp_posix_1(statement.data(), k.text.data(), k.text.size()) == 0)
+            return k.keyword;
+    return Keyword::kNone;
+}
+
+ValueScan scan_value(std::string_view text, char terminator) {
+    size_t i = 0;
+    while (i < text.size() && text[i] == ' ') ++i;
+    size_t first = std::string_view::npos;
+    size_t last = 0;
+    for (; i < text.size(); ++i) {
+        const char c = text[i];
+        if (c == terminator) break;
+        if (c == '\n') return {21, i, 0, 0};
+        if (!is_space(c)) {
+            if (first == std::string_view::npos) first = i;
+            last = i;
+        }
+    }
+    // The end of the text stands for the LF the loader appends.
+    if (i == text.size() && terminator != '\n') return {21, i, 0, 0};
+    if (first == std::string_view::npos) return {0, i, 0, 0};
+    return {0, i, first, last - first + 1};
+}
+
+ParseResult parse(std::string_view text, const ParseSink &sink) {
+    Cursor cursor(text);
+    Record record;
+    size_t pos = 0;
+    size_t line = 1;
+    auto invalid = [&](int point, size_t offset, size_t at_line) { return ParseResult{21, point, offset, at_line}; };
+    auto from_sink = [&](int32_t status, size_t offset) { return ParseResult{status, 0, offset, line}; };
+
+    // Reads the value list after the ":" at `colon` into `rule.attr`; leaves
+    // `pos` on the line's LF.
+    auto read_values = [&](const AttrRule &rule, size_t colon) -> int32_t {
+        int32_t n = 0;
+        size_t p = colon;
+        for (;;) {
+            ++p;  // past the ":" or the blank that ended the previous value
+            ValueScan v = scan_value(text.substr(p), ' ');
+            if (v.status != 0) break;
+            if (v.length != 0) {
+                if (int32_t s = sink.value(sink.context, rule.attr, text.substr(p + v.begin, v.length))) return s;
+                ++n;
+            }
+            p += v.consumed;
+        }
+        ValueScan last = scan_value(text.substr(p), '\n');
+        if (last.length != 0) {
+            if (int32_t s = sink.value(sink.context, rule.attr, text.substr(p + last.begin, last.length))) return s;
+            ++n;
+        }
+        record.count[rule.attr] = n;
+        pos = p + last.consumed;
+        return 0;
+    };
+
+    while (pos < text.size()) {
+        const char c = text[pos];
+        if (is_space(c)) {
+            if (c == '\n') ++line;
+            ++pos;
+            continue;
+        }
+        const size_t statement = pos;
+        if (c == '#') {
+            pos = cursor.line_end(pos) + 1;
+            ++line;
+            continue;
+        }
+        const Keyword keyword = keyword_of(text.substr(pos));
+        const AttrRule *rule = nullptr;
+        switch (keyword) {
+        case Keyword::kNode: {
+            if (record.open) {
+                if (!record.complete()) return invalid(157, record.offset, record.line);
+                if (int32_t s = sink.record(sink.context)) return from_sink(s, statement);
+            }
+            const size_t colon = cursor.colon(pos + 4);
+            if (colon == std::string_view::npos) return invalid(164, statement, line);
+            record = Record{};
+            record.open = true;
+            record.offset = statement;
+            record.line = line;
+            pos = colon + 1;
+            continue;
+        }
+        case Keyword::kName: rule = &kNameRule; break;
+        case Keyword::kAddress: rule = &kAddressRule; break;
+        case Keyword::kCluster: rule = &kClusterRule; break;
+        case Keyword::kNone: return invalid(171, statement, line);
+        }
+        if (!record.open || record.count[rule->attr] != 0) return invalid(rule->not_allowed_point, statement, line);
+        const size_t colon = cursor.colon(pos + rule->keyword_length);
+        if (colon == std::string_view::npos) return invalid(rule->no_colon_point, statement, line);
+        if (int32_t s = read_values(*rule, colon)) return from_sink(s, statement);
+    }
+    if (record.open) {
+        if (!record.complete()) return invalid(157, record.offset, record.line);
+        if (int32_t s = sink.record(sink.context)) return from_sink(s, text.size());
+    }
+    return {0, 0, text.size(), line};
+}
+
+char *copy_value(const char *begin, size_t length) {
+    auto *copy = static_cast<char *>(xcalloc(length + 1, 1));
+    if (copy == nullptr) {
+        report_no_memory("idm__extract_attr_value", length + 1);
+        return nullptr;
+    }
+    std::memcpy(copy, begin, length);
+    return copy;
+}
+
+namespace {
+
+// ---- building the trees from the parse ----
+
+// One working list of value copies (names, addresses or clusters).
+struct WorkList {
+    char **values = nullptr;
+    int32_t count = 0;
+    int32_t capacity = 0;
+};
+
+// The parse's sink while loading: the three working lists and the record
+// store.  Owns the lists and every value still in them; the destructor (also
+// the cancellation clean-up) releases them.
+class Builder {
+  public:
+    // Storing records may make at most this many bytes of tree records per
+    // byte of text (plus a fixed allowance): each record gets its own copy of
+    // its host's cluster list, so a hostile file listing many names and many
+    // clusters in one record would otherwise ask for memory and time growing
+    // with their product.  Real files stay far below it.
+    static constexpr size_t kRecordBytesPerTextByte = 64;
+    static constexpr size_t kRecordBytesAllowance = size_t{16} << 20;
+
+    explicit Builder(size_t text_size)
+        : record_budget_(text_size * kRecordBytesPerTextByte + kRecordBytesAllowance) {}
+    ~Builder() { release(); }
+    Builder(const Builder &) = delete;
+    Builder &operator=(const Builder &) = delete;
+
+    // 0, or 6 after reporting (2650-654 and trace point 163).
+    int32_t allocate_lists() {
+        static constexpr int32_t kSites[3] = {kSiteNames, kSiteAddresses, kSiteClusters};
+        for (int a = 0; a < 3; ++a) {
+            lists_[a].values = static_cast<char **>(xcalloc(kListStep, sizeof(char *)));
+            if (lists_[a].values == nullptr) {
+                report_no_memory("idm__construct_clcfg", kListStep * sizeof(char *));
+                trace_alloc_failure(kSites[a], kListStep * sizeof(char *));
+                return 6;
+            }
+            lists_[a].capacity = kListStep;
+        }
+        return 0;
+    }
+
+    void release() {
+        for (WorkList &l : lists_) {
+            if (l.values != nullptr) idm__free_arrays(l.values, l.capacity);
+            std::free(l.values);
+            l = WorkList{};
+        }
+    }
+
+    ParseSink sink() { return {this, &Builder::on_value, &Builder::on_record}; }
+
+  private:
+    static int32_t on_value(void *self, Attr attr, std::string_view value) {
+        return static_cast<Builder *>(self)->add_value(attr, value);
+    }
+    static int32_t on_record(void *self) { return static_cast<Builder *>(self)->store_record(); }
+
+    int32_t add_value(Attr attr, std::string_view value) {
+        WorkList &l = lists_[attr];
+        char *copy = copy_value(value.data(), value.size());
+        if (copy == nullptr) return 6;
+        l.values[l.count++] = copy;
+        if (l.count == l.capacity) return grow(attr);
+        return 0;
+    }
+
+    int32_t grow(Attr attr) {
+        static constexpr int32_t kSites[3] = {kSiteGrowNames, kSiteGrowAddresses, kSiteGrowClusters};
+        WorkList &l = lists_[attr];
+        const size_t capacity = static_cast<size_t>(l.capacity) + kListStep;
+        const size_t bytes = capacity * sizeof(char *);
+        auto **grown = static_cast<char **>(xrealloc(l.values, bytes));
+        if (grown == nullptr) {
+            report_no_memory("idm__construct_clcfg", bytes);
+            trace_alloc_failure(kSites[attr], bytes);
+            return 6;
+        }
+        std::memset(grown + l.capacity, 0, kListStep * sizeof(char *));
+        l.values = grown;
+        l.capacity = static_cast<int32_t>(capacity);
+        return 0;
+    }
+
+    void trace_record() const {
+        trace::record_id(158);
+        static constexpr int kPoints[3] = {159, 160, 161};
+        for (int a = 0; a < 3; ++a)
+            for (int32_t i = 0; i < lists_[a].count; ++i) {
+                const char *v = lists_[a].values[i];
+                trace::record_data(kPoints[a], trace::i32(i), trace::text(v != nullptr ? v : kNullValue));
+            }
+    }
+
+    // Makes the tree record of one key within the record budget.
+    int32_t make_node(const char *key, size_t cluster_bytes, idm_clnode **node) {
+        const WorkList &clusters = lists_[kClusters];
+        const size_t need = sizeof(idm_clnode) + std::strlen(key) + 1 + cluster_bytes;
+        if (need > record_budget_ - record_spent_) {
+            *node = nullptr;
+            return report_no_memory("idm__getnode", static_cast<size_t>(clusters.count) * sizeof(char *));
+        }
+        record_spent_ += need;
+        return idm__getnode(key, clusters.values, clusters.count, node);
+    }
+
+    // Stores one record per value of `attr` into `tree`; the first record
+    // stored for a key wins.
+    int32_t store_keys(Attr attr, rst_tree *tree, const char *label, size_t cluster_bytes) {
+        const WorkList &keys = lists_[attr];
+        for (int32_t i = 0; i < keys.count; ++i) {
+            const char *key = keys.values[i];
+            idm_clnode *node = nullptr;
+            if (make_node(key, cluster_bytes, &node) != 0) {
+                if (trace::diag_on())
+                    trace::record_data(162, trace::text(label), trace::text(*key != '\0' ? key : kNullValue));
+                return 6;
+            }
+            void *item = node;
+            const int r = sec__rst_insert(tree, &item);
+            if (r < 0) {
+                idm__rtree_cleanup_routine(node);
+                if (trace::error_on()) trace::record_data(172, trace::text(label));
+                return report(23, kMsg691);
+            }
+            if (r == 0) idm__rtree_cleanup_routine(node);
+        }
+        return 0;
+    }
+
+    int32_t store_record() {
+        if (trace::diag_on()) trace_record();
+        const WorkList &clusters = lists_[kClusters];
+        size_t cluster_bytes = static_cast<size_t>(clusters.count) * sizeof(char *);
+        for (int32_t i = 0; i < clusters.count; ++i) cluster_bytes += std::strlen(clusters.values[i]) + 1;
+        if (int32_t s = store_keys(kNames, &nametree, "NAME", cluster_bytes)) return s;
+        if (int32_t s = store_keys(kAddresses, &iptree, "ADDRESS", cluster_bytes)) return s;
+        for (WorkList &l : lists_) {
+            idm__free_arrays(l.values, l.count);
+            l.count = 0;
+        }
+        return 0;
+    }
+
+    WorkList lists_[3];
+    size_t record_budget_;
+    size_t record_spent_ = 0;
+};
+
+// Empties both trees under the write hold (file missing or empty).
+void empty_trees(MapHold &hold) {
+    hold.promote();
+    {
+        NoCancel no_cancel;
+        clean_trees();
+    }
+    hold.demote();
+}
+
+bool is_address(const char *host) {
+    unsigned char address[sizeof(struct in6_addr)];
+    return inet_pton(AF_INET, host, address) == 1 || inet_pton(AF_INET6, host, address) != 0;
+}
+
+// The reload rule; see read_clmap_file.
+int32_t load(MapHold &hold) {
+    struct stat st;
+    if (::stat(kNodeInfoPath, &st) != 0) {
+        if (errno != ENOENT) return report(21, kMsg692);
+        empty_trees(hold);
+        return 0;
+    }
+    if (st.st_size == 0) {
+        empty_trees(hold);
+        if (st.st_mtime != load_lastmod()) store_lastmod(st.st_mtime);
+        return 0;
+    }
+    if (st.st_mtime == load_lastmod()) return 0;
+    // Stored before the file is opened: a failure below is not retried until
+    // the time changes again.
+    store_lastmod(st.st_mtime);
+    ReloadUnlessDone reload;
+    FileHold file(::open(kNodeInfoPath, O_RDONLY | O_CLOEXEC));
+    if (file.fd() < 0) {
+        reload.done();
+        return report(21, kMsg693);
+    }
+    const size_t size = static_cast<size_t>(st.st_size);
+    std::unique_ptr<char, decltype(&std::free)> text(static_cast<char *>(xmalloc(size + 1)), &std::free);
+    if (text == nullptr) {
+        file.close();
+        reload.done();
+        return report_no_memory("idm__read_clmap_file", size + 1);
+    }
+    const ssize_t got = ::read(file.fd(), text.get(), size);
+    file.close();
+    if (got < 0 || static_cast<size_t>(got) != size) {
+        reload.done();
+        return report(21, kMsg694);
+    }
+    text.get()[size] = '\n';
+    const int32_t status = idm__construct_clcfg(hold, text.get(), size + 1);
+    reload.done();
+    return status;
+}
+
+}  // namespace
+
+MapHold::MapHold(sec_rwlock *lock) : lock_(lock) {
+    sec__lock_read(lock_);
+    mode_ = kRead;
+}
+
+MapHold::~MapHold() {
+    if (mode_ == kRead) sec__unlock_read(lock_);
+    else if (mode_ == kWrite) sec__unlock_write(lock_);
+}
+
+void MapHold::promote() {
+    mode_ = kNone;  // the read share is given up before the wait
+    sec__lock_promote(lock_);
+    mode_ = kWrite;
+}
+
+void MapHold::demote() {
+    mode_ = kNone;  // the write hold is given up before the wait
+    sec__lock_demote(lock_);
+    mode_ = kRead;
+}
+
+}  // namespace idm::clmap
+
+using idm::clmap::MapHold;
+
+int32_t idm__construct_clcfg(MapHold &hold, const char *text, size_t size) {
+    if (trace::diag_on()) {
+        const int64_t length = static_cast<int64_t>(size);
+        trace::record_data(155, trace::ptr(text), trace::i64(length));
+    }
+    idm::clmap::Builder builder(size);
+    int32_t status = builder.allocate_lists();
+    hold.promote();
+    {
+        idm::clmap::NoCancel no_cancel;
+        idm::clmap::clean_trees();
+        if (status == 0) {
+            const idm::clmap::ParseSink sink = builder.sink();
+            const idm::clmap::ParseResult r = idm::clmap::parse(std::string_view(text, size), sink);
+            if (r.status == 21) {
+                if (trace::error_on()) trace::record_id(r.point);
+                report(21, kMsg690);
+            }
+            status = r.status;
+            if (status != 0) idm::clmap::clean_trees();
+        }
+        builder.release();
+    }
+    hold.demote();
+    return status;
+}
+
+int32_t idm__read_clmap_file(MapHold &hold) {
+    if (trace::level(trace::kApi) != 0) trace::record_id(154);
+    const int32_t status = idm::clmap::load(hold);
+    if (trace::level(trace::kApi) != 0) trace::record_data(173, trace::i32(status));
+    return status;
+}
+
+int32_t sec__get_cluster_names(MapHold &hold, const char *host, char ***clusters, int32_t *count) {
+    trace::Api api(idm::clmap::kNamesIds, trace::text(host, idm::clmap::kNullHost));
+    *clusters = nullptr;
+    *count = 0;
+    int32_t status = idm__read_clmap_file(hold);
+    if (status != 0) return api.leave(status);
+    if (host == nullptr) return api.leave(idm::clmap::kNotFound);
+    idm_clnode *probe = nullptr;
+    if (idm__getnode(host, nullptr, 0, &probe) != 0) return api.leave(6);
+    rst_tree *tree = idm::clmap::is_address(host) ? &iptree : &nametree;
+    status = idm::clmap::kNotFound;
+    void *item = probe;
+    if (tree->rst_node_cnt != 0 && sec__rst_find(tree, &item) == 1) {
+        const auto *found = static_cast<const idm_clnode *>(item);
+        *clusters = found->clusters;
+        *count = found->count;
+        status = 0;
+    }
+    idm__rtree_cleanup_routine(probe);
+    return api.leave(status);
+}
 
 extern "C" {
 
-__attribute__((visibility("default"))) void sec__idm_clmap_init(void) {}
+int32_t idm__extract_attr_value(const char *text, int32_t *consumed, char **attr_value, char terminator) {
+    static constexpr const char kName[] = "idm__extract_attr_value";
+    if (text == nullptr) return report_bad_internal_param(23, kName, 1, hex(text));
+    if (consumed == nullptr) return report_bad_internal_param(23, kName, 2, hex(consumed));
+    if (attr_value == nullptr) return report_bad_internal_param(23, kName, 3, hex(attr_value));
+    *attr_value = nullptr;
+    // The value ends at the terminator or at the line's LF at the latest.
+    const char *end = static_cast<const char *>(std::strchr(text, '\n'));
+    const size_t length = end != nullptr ? static_cast<size_t>(end - text) + 1 : std::strlen(text);
+    const idm::clmap::ValueScan v = idm::clmap::scan_value(std::string_view(text, length), terminator);
+    *consumed = static_cast<int32_t>(v.consumed);
+    if (v.status != 0) return report(21, kMsg690);
+    if (v.length == 0) return 0;
+    *attr_value = idm::clmap::copy_value(text + v.begin, v.length);
+    return *attr_value != nullptr ? 0 : 6;
+}
+
+int32_t idm__getnode(const char *key, char **clusters, int32_t count, idm_clnode **node) {
+    static constexpr const char kName[] = "idm__getnode";
+    if (node == nullptr) return report_bad_internal_param(23, kName, 4, hex(node));
+    *node = nullptr;
+    if (key == nullptr) return report_bad_internal_param(23, kName, 1, hex(key));
+    if (count < 0 || (count > 0 && clusters == nullptr))
+        return report_bad_internal_param(23, kName, 3, hex(static_cast<uintptr_t>(static_cast<intptr_t>(count))));
+    auto *n = static_cast<idm_clnode *>(xcalloc(1, sizeof(idm_clnode)));
+    if (n == nullptr) return report_no_memory(kName, sizeof(idm_clnode));
+    const size_t key_length = std::strlen(key);
+    n->key = static_cast<char *>(xmalloc(key_length + 1));
+    if (n->key == nullptr) {
+        idm__rtree_cleanup_routine(n);
+        return report_no_memory(kName, key_length);
+    }
+    std::memcpy(n->key, key, key_length + 1);
+    if (count > 0) {
+        n->clusters = static_cast<char **>(xcalloc(static_cast<size_t>(count), sizeof(char *)));
+        if (n->clusters == nullptr) {
+            idm__rtree_cleanup_routine(n);
+            return report_no_memory(kName, static_cast<size_t>(count) * sizeof(char *));
+        }
+        n->count = count;
+        for (int32_t i = 0; i < count; ++i) {
+            if (clusters[i] == nullptr) continue;
+            const size_t length = std::strlen(clusters[i]);
+            n->clusters[i] = static_cast<char *>(xmalloc(length + 1));
+            if (n->clusters[i] == nullptr) {
+                idm__rtree_cleanup_routine(n);
+                return report_no_memory(kName, length);
+            }
+            std::memcpy(n->clusters[i], clusters[i], length + 1);
+        }
+    }
+    *node = n;
+    return 0;
+}
+
+void idm__free_arrays(char **array, int32_t count) {
+    if (array == nullptr) return;
+    for (int32_t i = 0; i < count; ++i) {
+        std::free(array[i]);
+        array[i] = nullptr;
+    }
+}
+
+int idm__rtree_compare_routine(const void *probe, const void *stored) {
+    return std::strcmp(static_cast<const idm_clnode *>(probe)->key, static_cast<const idm_clnode *>(stored)->key);
+}
+
+void idm__rtree_cleanup_routine(void *item) {
+    auto *n = static_cast<idm_clnode *>(item);
+    if (n == nullptr) return;
+    std::free(n->key);
+    if (n->clusters != nullptr) {
+        idm__free_arrays(n->clusters, n->count);
+        std::free(n->clusters);
+    }
+    std::free(n);
+}
+
+__attribute__((visibility("default"))) void sec__idm_clmap_init(void) {
+    unsigned char api = trace::level(trace::kApi);
+    if (api == 1 || api == 8) trace::record_id(148);
+    sec__lock_init(&idmutex);
+    idm::clmap::store_lastmod(0);
+    sec__lock_write(&idmutex);
+    sec__rst_init(&nametree, idm__rtree_compare_routine, idm__rtree_cleanup_routine);
+    sec__rst_init(&iptree, idm__rtree_compare_routine, idm__rtree_cleanup_routine);
+    sec__unlock_write(&idmutex);
+    api = trace::level(trace::kApi);
+    if (api == 1 || api == 8) trace::record_id(149);
+}
 
 __attribute__((visibility("default"))) int32_t sec_is_in_any_cluster(const char *host) {
-    (void)host;
+    trace::Api api(idm::clmap::kAnyIds, trace::text(host, idm::clmap::kNullHost));
     pthread_once(&idm__init_once_block, idm__state_init);
-    return -1;
+    int32_t answer = -1;
+    {
+        MapHold hold(&idmutex);
+        char **clusters = nullptr;
+        int32_t count = 0;
+        if (sec__get_cluster_names(hold, host, &clusters, &count) == 0)
+            answer = count != 0 && clusters != nullptr ? 1 : 0;
+    }
+    return api.leave(answer);
 }
 
 __attribute__((visibility("default"))) int32_t sec_is_in_active_cluster(const char *host) {
-    (void)host;
+    trace::Api api(idm::clmap::kActiveIds, trace::text(host, idm::clmap::kNullHost));
     pthread_once(&idm__init_once_block, idm__state_init);
-    return -1;
+    int32_t answer = -1;
+    {
+        MapHold hold(&idmutex);
+        cu_cluster_info_t info{};
+        if (cu_get_cluster_info_1(&info) == 0) {
+            info.cluster_name[sizeof info.cluster_name - 1] = '\0';
+            char **clusters = nullptr;
+            int32_t count = 0;
+            if (sec__get_cluster_names(hold, host, &clusters, &count) == 0) {
+                answer = 0;
+                for (int32_t i = 0; i < count; ++i)
+                    if (clusters[i] != nullptr && std::strcmp(clusters[i], info.cluster_name) == 0) {
+                        answer = 1;
+                        break;
+                    }
+            }
+        }
+    }
+    return api.leave(answer);
 }
 
 }  // extern "C"

@@ -1,0 +1,157 @@
+// Cluster map: the node information file /var/ox/cfg/oxsec.nodeinfo, the
+// two search trees that hold it, and the membership lookup behind the
+// exported queries.
+//
+// State (all process-wide, set up by sec__idm_clmap_init, never torn down):
+//   nametree, iptree  guarded by idmutex; read under a read share, changed
+//                     only between a promotion and a demotion of idmutex
+//   lastmod           the file's modification time (whole seconds) at the
+//                     last load attempt; read and written whole (atomically)
+//                     by threads that hold only a read share
+//   idmutex           the reader-writer lock (oxsec_lock); the only lock of
+//                     this module, independent of the mapping locks
+//
+// The judgement of the text is split from the file walk: parse() and
+// scan_value() are pure functions of a text (no trees, no reports, no
+// trace), called by the loader and usable by a fuzzer or a checker tool.
+#ifndef OXIDM_CLMAP_H
+#define OXIDM_CLMAP_H
+
+#include <cstddef>
+#include <cstdint>
+#include <string_view>
+
+#include "oxsec_lock.h"
+#include "oxsec_rstree.h"
+
+// One tree entry: a host name (nametree) or address text (iptree) and a copy
+// of its record's cluster names in file order.  Every stored record has a
+// count of at least 1; only a lookup's probe has count 0 and no array.
+struct idm_clnode {
+    char *key;        // owned; the tree key, exactly as written in the file
+    char **clusters;  // owned array of `count` owned strings, or null
+    int32_t count;
+};
+
+namespace idm::clmap {
+
+inline constexpr char kNodeInfoPath[] = "/var/ox/cfg/oxsec.nodeinfo";
+inline constexpr int32_t kNotFound = 1;  // host not listed: no failure, nothing reported
+
+// The calling query's hold of idmutex.  A read share from construction; the
+// write hold between promote() and demote(); nothing while either of them
+// waits, since both give up the previous hold first.  The destructor
+// releases whatever is held at that moment, so a query cancelled anywhere
+// (in a lock wait, in open or read) leaves idmutex consistent.
+class MapHold {
+  public:
+    explicit MapHold(sec_rwlock *lock);
+    ~MapHold();
+    void promote();
+    void demote();
+    MapHold(const MapHold &) = delete;
+    MapHold &operator=(const MapHold &) = delete;
+
+  private:
+    enum Mode { kNone, kRead, kWrite };
+    sec_rwlock *lock_;
+    Mode mode_ = kNone;
+};
+
+// ---- pure judgement of the text ----
+
+enum class Keyword { kNone, kNode, kName, kAddress, kCluster };
+enum Attr : int { kNames = 0, kAddresses = 1, kClusters = 2 };
+
+// The keyword a statement begins with: its own length of text compared
+// without regard to case (cu_8bit_strncasecmp_posix_1), in the order NODE,
+// NAME, ADDRESS, CLUSTER.  Only that prefix counts ("Nodes" is NODE).
+Keyword keyword_of(std::string_view statement);
+
+// One value of a value list, cut from the start of `text`.  Blanks (0x20)
+// are skipped first; the value runs from its first to its last non-space
+// character before `terminator` (whitespace inside it, such as a tab, is
+// kept).  An LF (or the end of `text`) before a blank terminator ends the
+// line: status 21.  Otherwise status 0, `consumed` is the terminator's
+// offset and `length` 0 when there was no value.
+struct ValueScan {
+    int32_t status;
+    size_t consumed;
+    size_t begin;
+    size_t length;
+};
+ValueScan scan_value(std::string_view text, char terminator);
+
+// Receives the parse's results.  value(): one non-empty value of the open
+// record's attribute, in file order.  record(): the open record is complete
+// (at the next NODE or at the end).  A non-zero status from either stops
+// the parse with that status.  No virtual calls: two routines and a context.
+struct ParseSink {
+    void *context;
+    int32_t (*value)(void *context, Attr attr, std::string_view value);
+    int32_t (*record)(void *context);
+};
+
+// Outcome of a parse.  status 0: every record was handed over.  status 21:
+// invalid text; `point` is the trace point that names the fault (157, 164
+// to 171), `offset` where the statement begins and `line` its line (from
+// 1).  Any other status came from the sink (point 0).
+struct ParseResult {
+    int32_t status;
+    int point;
+    size_t offset;
+    size_t line;
+};
+
+// Parses node information text (the loader appends an LF; a text without a
+// final LF is judged as if it had one).  Never allocates, reports or traces.
+ParseResult parse(std::string_view text, const ParseSink &sink);
+
+// A value of `length` bytes at `begin` as a zero-filled heap string, or
+// nullptr after reporting 2650-654 for idm__extract_attr_value.
+char *copy_value(const char *begin, size_t length);
+
+}  // namespace idm::clmap
+
+// ---- the loader (the caller holds `hold` as a read share; so on return) ----
+
+// Looks `host` up after reloading the file when its time changed.  0: found,
+// *clusters/*count are the stored record's (owned by the tree, valid while
+// the read share is held).  1: not found (also a null or empty host, a
+// missing or empty file, an empty tree; nothing reported).  6 memory, 21
+// file access or syntax, 23 tree insertion (each reported where detected).
+int32_t sec__get_cluster_names(idm::clmap::MapHold &hold, const char *host, char ***clusters, int32_t *count);
+// The reload rule.  0: the trees are as current as this load could make
+// them; 6, 21, 23 as above.
+int32_t idm__read_clmap_file(idm::clmap::MapHold &hold);
+// Parses `text` (`size` bytes, ending with an LF) and rebuilds both trees
+// under the write hold.  Any failure leaves both trees empty.
+int32_t idm__construct_clcfg(idm::clmap::MapHold &hold, const char *text, size_t size);
+
+extern "C" {
+
+extern rst_tree nametree;  // keyed by host name
+extern rst_tree iptree;    // keyed by address text
+extern int64_t lastmod;    // atomically accessed
+extern sec_rwlock idmutex;
+
+// Extracts one value as scan_value() cuts it.  0: *attr_value is the
+// value's heap copy (free), or null when there was none; *consumed is the
+// terminator's offset.  21: the line ended before the blank terminator
+// (*consumed is the LF's offset; 2650-690 reported).  6: no memory
+// (2650-654 reported).
+int32_t idm__extract_attr_value(const char *text, int32_t *consumed, char **attr_value, char terminator);
+// 0: *node is a new record with a copy of key and, for count > 0, a new
+// array of count entries copying each non-null entry of clusters.  6: no
+// memory (2650-654 reported, *node null, nothing left allocated).
+int32_t idm__getnode(const char *key, char **clusters, int32_t count, idm_clnode **node);
+// Frees each non-null entry of the first count entries and nulls it.
+void idm__free_arrays(char **array, int32_t count);
+// strcmp of the two records' keys.
+int idm__rtree_compare_routine(const void *probe, const void *stored);
+// Frees a record with its key, cluster strings and array; null is ignored.
+void idm__rtree_cleanup_routine(void *node);
+
+}  // extern "C"
+
+#endif
