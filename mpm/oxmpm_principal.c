@@ -1,0 +1,160 @@
+/*
+ * oxmpm_principal.c - sample MPM "princ": translator and cleanup routine for
+ * principal names name[/instance]@REALM.  Syntax and statuses:
+ * oxmpm_principal.h.
+ *
+ * Memory: each structure the translator fills owns exactly one heap block,
+ * hung on its `tokens` field; the token array, every text and (for a rule)
+ * the mapping buffer live inside it, with the block's size stored in front.
+ * The cleanup routine zeroes the block (it held identities) and frees it.
+ * `rgy_type` points to the constant mnemonic and is never freed.
+ *
+ * The routines keep no state and take no lock.
+ */
+#define _DEFAULT_SOURCE /* explicit_bzero */
+#include "oxmpm_principal.h"
+
+#include <stddef.h>
+#include <stdlib.h>
+#include <string.h>
+
+#define EXPORT __attribute__((visibility("default")))
+
+enum { ST_OK = 0, ST_BAD_ID = 38, ST_REFUSED = 39, ST_NO_MEMORY = 12 };
+
+static char mnemonic[] = OXMPM_PRINCIPAL_MNEMONIC;
+
+/* A principal name split into its parts; instance_len 0 when absent. */
+struct principal {
+    const char *name, *instance, *realm;
+    size_t name_len, instance_len, realm_len;
+};
+
+static int split(const char *text, struct principal *p) {
+    const char *at = strchr(text, '@');
+    if (at == NULL || at[1] == '\0' || strchr(at + 1, '@') != NULL) return -1;
+    const char *slash = memchr(text, '/', (size_t)(at - text));
+    p->name = text;
+    p->realm = at + 1;
+    p->realm_len = strlen(at + 1);
+    if (slash == NULL) {
+        p->name_len = (size_t)(at - text);
+        p->instance = NULL;
+        p->instance_len = 0;
+    } else {
+        p->name_len = (size_t)(slash - text);
+        p->instance = slash + 1;
+        p->instance_len = (size_t)(at - slash - 1);
+        if (p->instance_len == 0 || memchr(p->instance, '/', p->instance_len) != NULL) return -1;
+    }
+    return p->name_len == 0 ? -1 : 0;
+}
+
+/* Heap block behind `tokens`: its size, the token array, the mapping
+ * buffer (rules only), then the texts. */
+struct block {
+    size_t size;
+    char *tokens[2];
+    idm_buffer mapping;
+    char text[];
+};
+
+static char *put(char *dst, const char *src, size_t n) {
+    memcpy(dst, src, n);
+    dst[n] = '\0';
+    return dst + n + 1;
+}
+
+/* Builds the block for `p` (plus `extra` bytes of text space) and points
+ * rgy, token_cnt and tokens of the caller's structure into it. */
+static struct block *make_block(const struct principal *p, size_t extra, char **rgy, int32_t *token_cnt,
+                                char ***tokens) {
+    size_t size = sizeof(struct block) + p->realm_len + 1 + p->name_len + 1 + p->instance_len + 1 + extra;
+    struct block *b = malloc(size);
+    if (b == NULL) return NULL;
+    b->size = size;
+    char *t = b->text;
+    *rgy = t;
+    t = put(t, p->realm, p->realm_len);
+    b->tokens[0] = t;
+    t = put(t, p->name, p->name_len);
+    b->tokens[1] = NULL;
+    *token_cnt = 1;
+    if (p->instance != NULL) {
+        b->tokens[1] = t;
+        put(t, p->instance, p->instance_len);
+        *token_cnt = 2;
+    }
+    b->mapping.length = 0;
+    b->mapping.value = NULL;
+    *tokens = b->tokens;
+    return b;
+}
+
+static void free_block(char **tokens) {
+    if (tokens == NULL) return;
+    struct block *b = (struct block *)(void *)((char *)tokens - offsetof(struct block, tokens));
+    explicit_bzero(b, b->size);
+    free(b);
+}
+
+static int32_t fill_rule(const idm_mapfile_entry *entry, idm_rule *rule) {
+    struct principal p;
+    if (entry->network_id == NULL || split(entry->network_id, &p) != 0) return ST_REFUSED;
+    int affirmative = entry->kind == IDM_ENTRY_AFFIRMATIVE && entry->local_id != NULL;
+    size_t local_len = affirmative ? strlen(entry->local_id) : 0;
+    struct block *b = make_block(&p, affirmative ? local_len + 1 : 0, &rule->rgy, &rule->token_cnt, &rule->tokens);
+    if (b == NULL) return ST_NO_MEMORY;
+    rule->rgy_type = mnemonic;
+    rule->mapping = NULL;
+    if (affirmative) {
+        char *t = b->text + (b->size - sizeof(struct block) - local_len - 1);
+        put(t, entry->local_id, local_len);
+        b->mapping.value = t;
+        b->mapping.length = (uint32_t)(local_len + 1);
+        rule->mapping = &b->mapping;
+    }
+    return ST_OK;
+}
+
+static int32_t fill_id(const char *network_id, idm_id *id) {
+    struct principal p;
+    if (network_id == NULL || split(network_id, &p) != 0) return ST_BAD_ID;
+    if (make_block(&p, 0, &id->rgy, &id->token_cnt, &id->tokens) == NULL) return ST_NO_MEMORY;
+    id->rgy_type = mnemonic;
+    return ST_OK;
+}
+
+EXPORT int32_t oxmpm_principal_translate(const idm_mapfile_entry *entry, const char *network_id, idm_rule *rule,
+                                         idm_id *id) {
+    if (rule == NULL || id == NULL) return ST_BAD_ID;
+    if (entry != NULL) {
+        int32_t s = fill_rule(entry, rule);
+        if (s != ST_OK) return s;
+    }
+    int32_t s = fill_id(network_id, id);
+    if (s == ST_NO_MEMORY && entry != NULL) oxmpm_principal_cleanup(rule, NULL); /* no cleanup call follows */
+    return s;
+}
+
+EXPORT int32_t oxmpm_principal_cleanup(idm_rule *rule, idm_id *id) {
+    if (rule != NULL) {
+        free_block(rule->tokens);
+        rule->rgy_type = rule->rgy = NULL;
+        rule->token_cnt = 0;
+        rule->tokens = NULL;
+        rule->mapping = NULL;
+    }
+    if (id != NULL) {
+        free_block(id->tokens);
+        id->rgy_type = id->rgy = NULL;
+        id->token_cnt = 0;
+        id->tokens = NULL;
+    }
+    return 0;
+}
+
+EXPORT int32_t oxmpm_principal_register(void) {
+    return sec_idm_register_translator(IDM_MAPPING_NATIVE, mnemonic, oxmpm_principal_translate,
+                                       oxmpm_principal_cleanup);
+}
