@@ -2,9 +2,13 @@
 // and the clean walk recurse once per level; random priorities keep the
 // expected height logarithmic whatever the order of insertion.  Search and
 // deletion walk iteratively.
-#include "oxsec_rstree.h"
-
+//
+// The node-count assertion of sec__rst_array holds in every build, so the
+// declaration of the assertion routine is wanted even under NDEBUG.
+#undef NDEBUG
 #include <assert.h>
+
+#include "oxsec_rstree.h"
 
 #include <cstdlib>
 #include <ctime>
