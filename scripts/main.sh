@@ -6,8 +6,4 @@ cd "$(dirname "$0")/.."
 scripts/deps.sh
 cmake --preset release >/dev/null
 cmake --build --preset release -j "$(nproc)" >/dev/null
-if [[ -x build/release/tools/oxidm ]]; then
-  exec tools/example-session.sh build/release
-else
-  exec build/release/tools/oxidm-demo
-fi
+exec tools/example-session.sh build/release

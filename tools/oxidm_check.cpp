@@ -1,0 +1,492 @@
+// Checkers for map files and the node information file.  The verdict on
+// every line or statement comes from the library's own pure judges; the
+// walk over the text copies the library's readers (pieces of at most 1023
+// characters for map files; one text with an appended LF for the node
+// information file), and the reasons and warnings are this module's words.
+#include "oxidm_check.h"
+
+#include <arpa/inet.h>
+
+#include <algorithm>
+#include <map>
+#include <string>
+
+#include "oxidm_clmap.h"
+#include "oxidm_natfile.h"
+
+namespace oxidm_tool::check {
+
+namespace {
+
+constexpr size_t kPieceMax = 1023;  // characters per read (1024-byte buffer)
+
+bool blank(char c) { return c == ' ' || c == '\t'; }
+
+std::string show(std::string_view s) {
+    std::string out;
+    for (unsigned char c : s) {
+        if (c == '\r') out += "\\r";
+        else if (c == '\t') out += "\\t";
+        else if (c < 0x20 || c == 0x7f) out += "?";
+        else out += static_cast<char>(c);
+    }
+    return out;
+}
+
+template <class Report>
+size_t count_of(const Report &r, Severity s) {
+    return static_cast<size_t>(std::count_if(r.findings.begin(), r.findings.end(),
+                                             [s](const Finding &f) { return f.severity == s; }));
+}
+
+// Why the library found a selected line invalid (rules 6 and 7), for a line
+// with the comment already cut and no line feed.
+std::string invalid_reason(std::string_view line, bool comment_cut) {
+    size_t colon = line.find(':');
+    size_t p = colon + 1;
+    while (p < line.size() && blank(line[p])) ++p;
+    if (p >= line.size()) return "nothing follows the mechanism selector";
+    std::string_view rule = line.substr(p);
+    if (rule[0] == '!') {
+        if (line.find('=', colon) != std::string_view::npos)
+            return "a denial ('!') must not contain '='";
+        return "the denial names no network identifier";
+    }
+    size_t eq = rule.find('=');
+    if (eq == std::string_view::npos)
+        return comment_cut ? "the '=' stands after a '#', which starts a comment"
+                           : "no '=': an affirmative rule is NETWORK_ID=LOCAL_ID";
+    if (eq == 0) return "the network identifier before '=' is empty";
+    return "the local identifier after '=' is empty";
+}
+
+// Text that the library reads past without using: between the network
+// identifier and '=', and after the identifier that ends the rule.
+void ignored_text(const idm::mapfile::LineVerdict &v, std::string_view line, size_t line_no,
+                  std::vector<Finding> &out) {
+    auto trailing = [&](std::string_view id) -> std::string_view {
+        size_t end = static_cast<size_t>(id.data() + id.size() - line.data());
+        std::string_view rest = line.substr(end);
+        size_t a = 0;
+        while (a < rest.size() && blank(rest[a])) ++a;
+        rest = rest.substr(a);
+        while (!rest.empty() && blank(rest.back())) rest.remove_suffix(1);
+        return rest;
+    };
+    if (v.kind == idm::mapfile::LineKind::kAffirmative) {
+        std::string_view between = trailing(v.network_id);
+        size_t eq = between.find('=');
+        between = between.substr(0, eq);
+        while (!between.empty() && blank(between.back())) between.remove_suffix(1);
+        if (!between.empty())
+            out.push_back({line_no, Severity::kWarning, "ignored-text",
+                           "text between the network identifier and '=' is ignored: \"" + show(between) + "\""});
+        std::string_view after = trailing(v.local_id);
+        if (!after.empty())
+            out.push_back({line_no, Severity::kWarning, "ignored-text",
+                           "text after the local identifier is ignored: \"" + show(after) + "\""});
+    } else if (v.kind == idm::mapfile::LineKind::kDenial) {
+        std::string_view after = trailing(v.network_id);
+        if (!after.empty())
+            out.push_back({line_no, Severity::kWarning, "ignored-text",
+                           "text after the denied identifier is ignored: \"" + show(after) + "\""});
+    }
+}
+
+bool same_ignoring_case(std::string_view a, std::string_view b) {
+    if (a.size() != b.size()) return false;
+    for (size_t i = 0; i < a.size(); ++i)
+        if (std::tolower(static_cast<unsigned char>(a[i])) != std::tolower(static_cast<unsigned char>(b[i])))
+            return false;
+    return true;
+}
+
+std::string trim_blanks(std::string_view s) {
+    while (!s.empty() && blank(s.front())) s.remove_prefix(1);
+    while (!s.empty() && blank(s.back())) s.remove_suffix(1);
+    return std::string(s);
+}
+
+}  // namespace
+
+const char *severity_name(Severity s) {
+    switch (s) {
+        case Severity::kError: return "error";
+        case Severity::kWarning: return "warning";
+        case Severity::kNote: return "note";
+    }
+    return "?";
+}
+
+size_t MapfileReport::errors() const { return count_of(*this, Severity::kError); }
+size_t MapfileReport::warnings() const { return count_of(*this, Severity::kWarning); }
+size_t NodeinfoReport::errors() const { return count_of(*this, Severity::kError); }
+size_t NodeinfoReport::warnings() const { return count_of(*this, Severity::kWarning); }
+
+bool wildcard_match(std::string_view pattern, std::string_view text) {
+    size_t star = pattern.find('*');
+    if (star == std::string_view::npos) return pattern == text;
+    std::string_view front = pattern.substr(0, star), back = pattern.substr(star + 1);
+    if (text.empty()) return false;
+    return text.size() >= front.size() + back.size() && text.substr(0, front.size()) == front &&
+           text.substr(text.size() - back.size()) == back;
+}
+
+bool field_covers(std::string_view outer, std::string_view inner) {
+    size_t star = outer.find('*');
+    if (star == std::string_view::npos) return inner == outer && inner.find('*') == std::string_view::npos;
+    size_t inner_star = inner.find('*');
+    if (inner_star == std::string_view::npos) return wildcard_match(outer, inner);
+    std::string_view f1 = outer.substr(0, star), s1 = outer.substr(star + 1);
+    std::string_view f2 = inner.substr(0, inner_star), s2 = inner.substr(inner_star + 1);
+    return f2.substr(0, std::min(f1.size(), f2.size())) == f1 && f2.size() >= f1.size() && s2.size() >= s1.size() &&
+           s2.substr(s2.size() - s1.size()) == s1;
+}
+
+// ---------------------------------------------------------------------------
+// Map files
+// ---------------------------------------------------------------------------
+
+MapfileReport check_mapfile_text(std::string_view text, const std::string *mechanism,
+                                 const std::function<bool(const std::string &)> &is_uid0,
+                                 const FieldSplitter &split, const std::vector<std::string> *known) {
+    using idm::mapfile::LineKind;
+    MapfileReport report;
+    size_t pos = 0, line_no = 1;
+    bool continuing = false;  // this piece continues the previous one's line
+    while (pos < text.size()) {
+        // One read: up to 1023 characters, or through the first line feed.
+        size_t limit = std::min(text.size(), pos + kPieceMax);
+        size_t lf = text.find('\n', pos);
+        size_t end = (lf != std::string_view::npos && lf < limit) ? lf + 1 : limit;
+        std::string_view piece = text.substr(pos, end - pos);
+        pos = end;
+        ++report.pieces;
+        bool ends_line = !piece.empty() && piece.back() == '\n';
+        size_t this_line = line_no;
+        if (!continuing && !ends_line && piece.size() == kPieceMax && pos < text.size())
+            report.findings.push_back({this_line, Severity::kWarning, "long-line",
+                                       "longer than 1023 characters: the library reads it as several lines, "
+                                       "each judged on its own"});
+        if (ends_line) ++line_no;
+        continuing = !ends_line;
+        // The parser sees the piece as a C string: up to its first NUL.
+        std::string_view seen = piece.substr(0, piece.find('\0'));
+        if (seen.size() != piece.size() && piece.find_first_not_of(std::string_view("\0\n", 2)) != std::string_view::npos)
+            report.findings.push_back({this_line, Severity::kWarning, "nul-byte",
+                                       "holds a NUL byte: the library reads the line only up to it"});
+
+        // The mechanism this piece is judged for.
+        std::string_view body = seen;
+        if (size_t nl = body.find('\n'); nl != std::string_view::npos) body = body.substr(0, nl);
+        size_t hash = body.find('#');
+        bool comment_cut = hash != std::string_view::npos && body.find('=', hash) != std::string_view::npos;
+        body = body.substr(0, hash);
+        size_t first = 0;
+        while (first < body.size() && blank(body[first])) ++first;
+        if (first == body.size()) continue;  // empty, blank or comment only
+        size_t colon = body.find(':', first);
+        if (colon == std::string_view::npos) {
+            report.findings.push_back({this_line, Severity::kWarning, "no-selector",
+                                       "no ':' after a mechanism name: every mechanism ignores this line"});
+            continue;
+        }
+        std::string selector(body.substr(first, colon - first));
+        std::string mech = mechanism ? *mechanism : selector;
+        if (mechanism && selector != *mechanism) {
+            if (same_ignoring_case(trim_blanks(selector), *mechanism))
+                report.findings.push_back({this_line, Severity::kWarning, "selector-mismatch",
+                                           "selector \"" + show(selector) + "\" is not \"" + *mechanism +
+                                               "\" (case and blanks count): ignored for " + *mechanism});
+            else
+                report.findings.push_back({this_line, Severity::kNote, "other-mechanism",
+                                           "a line of mechanism \"" + show(selector) + "\": ignored for " +
+                                               *mechanism});
+            continue;
+        }
+        if (selector.empty()) {
+            report.findings.push_back({this_line, Severity::kWarning, "empty-selector",
+                                       "empty mechanism selector: no mechanism reads this line"});
+            continue;
+        }
+        if (!mechanism && known && std::find(known->begin(), known->end(), selector) == known->end()) {
+            auto like = std::find_if(known->begin(), known->end(), [&](const std::string &k) {
+                return same_ignoring_case(trim_blanks(selector), k);
+            });
+            if (like != known->end())
+                report.findings.push_back({this_line, Severity::kWarning, "selector-mismatch",
+                                           "selector \"" + show(selector) + "\" is not \"" + *like +
+                                               "\" (case and blanks count): mechanism " + *like + " ignores it"});
+            else
+                report.findings.push_back({this_line, Severity::kNote, "unknown-mechanism",
+                                           "no known mechanism is named \"" + show(selector) + "\""});
+        } else if (!mechanism && (blank(selector.back()) || trim_blanks(selector) != selector))
+            report.findings.push_back({this_line, Severity::kWarning, "selector-blank",
+                                       "selector \"" + show(selector) +
+                                           "\" ends in a blank: it selects no mechanism whose name lacks it"});
+
+        idm::mapfile::LineVerdict v = idm::mapfile::judge_line(mech, piece.substr(0, seen.size()));
+        if (v.kind == LineKind::kSkipped) continue;  // cannot happen for a matching selector
+        if (v.kind == LineKind::kInvalid) {
+            report.findings.push_back({this_line, Severity::kError, "invalid-rule",
+                                       "invalid rule, ignored by the library: " + invalid_reason(body, comment_cut)});
+            continue;
+        }
+        MapEntry e{this_line, mech,
+                   v.kind == LineKind::kDenial ? EntryKind::kDenial : EntryKind::kAffirmative,
+                   std::string(v.network_id), std::string(v.local_id)};
+        ignored_text(v, body, this_line, report.findings);
+        std::string_view last = e.kind == EntryKind::kDenial ? std::string_view(e.network_id)
+                                                             : std::string_view(e.local_id);
+        if (!last.empty() && last.back() == '\r')
+            report.findings.push_back({this_line, Severity::kWarning, "carriage-return",
+                                       "ends in a carriage return, which becomes part of the identifier"});
+        report.entries.push_back(std::move(e));
+    }
+    report.lines = line_no - 1 + (continuing ? 1 : 0);
+
+    // Entries that grant a privileged account to a wildcard, and entries that
+    // an earlier entry of the same mechanism shadows.
+    std::vector<std::vector<std::string>> fields(report.entries.size());
+    std::vector<bool> exact(report.entries.size());
+    for (size_t i = 0; i < report.entries.size(); ++i) {
+        const MapEntry &e = report.entries[i];
+        exact[i] = split && split(e, fields[i]);
+        if (!exact[i]) fields[i] = {e.network_id};
+        if (e.kind == EntryKind::kAffirmative && e.network_id.find('*') != std::string::npos &&
+            (e.local_id == "root" || (is_uid0 && is_uid0(e.local_id))))
+            report.findings.push_back({e.line, Severity::kWarning, "wildcard-root",
+                                       "the wildcard identifier \"" + show(e.network_id) +
+                                           "\" maps to \"" + show(e.local_id) + "\", an account with uid 0"});
+    }
+    auto usable = [&](size_t i) {
+        for (const std::string &f : fields[i])
+            if (std::count(f.begin(), f.end(), '*') > 1) return false;
+        return true;
+    };
+    for (size_t j = 0; j < report.entries.size(); ++j) {
+        const MapEntry &d = report.entries[j];
+        if (!usable(j)) continue;
+        for (size_t i = 0; i < j; ++i) {
+            const MapEntry &e = report.entries[i];
+            if (e.mechanism != d.mechanism || exact[i] != exact[j] || !usable(i) ||
+                fields[i].size() != fields[j].size())
+                continue;
+            bool covers = true;
+            for (size_t k = 0; k < fields[i].size() && covers; ++k) covers = field_covers(fields[i][k], fields[j][k]);
+            if (!covers) continue;
+            std::string earlier = "line " + std::to_string(e.line) + " (" +
+                                  (e.kind == EntryKind::kDenial ? "!" + show(e.network_id)
+                                                                : show(e.network_id) + "=" + show(e.local_id)) +
+                                  ")";
+            if (d.kind == EntryKind::kDenial && e.kind == EntryKind::kAffirmative)
+                report.findings.push_back({d.line, Severity::kWarning, "dead-denial",
+                                           "this denial can never take effect: " + earlier +
+                                               " matches every identity it names first"});
+            else if (d.kind == EntryKind::kDenial)
+                report.findings.push_back({d.line, Severity::kNote, "redundant-denial",
+                                           "already denied by " + earlier});
+            else
+                report.findings.push_back({d.line, Severity::kNote, "shadowed-entry",
+                                           "never used: " + earlier + " matches every identity it names first"});
+            break;
+        }
+    }
+    std::stable_sort(report.findings.begin(), report.findings.end(),
+                     [](const Finding &a, const Finding &b) { return a.line < b.line; });
+    return report;
+}
+
+// ---------------------------------------------------------------------------
+// Node information file
+// ---------------------------------------------------------------------------
+
+namespace {
+
+// Offsets of line starts, for turning a view into its line number.
+struct LineIndex {
+    std::vector<size_t> starts{0};
+    explicit LineIndex(std::string_view text) {
+        for (size_t i = 0; i < text.size(); ++i)
+            if (text[i] == '\n') starts.push_back(i + 1);
+    }
+    size_t line_of(size_t offset) const {
+        return static_cast<size_t>(std::upper_bound(starts.begin(), starts.end(), offset) - starts.begin());
+    }
+};
+
+// Collects the parse's values per record, as the loader's working lists do.
+struct Collector {
+    std::string_view text;
+    const LineIndex *index;
+    bool keep;  // store hosts (the first, authoritative parse only)
+    std::vector<std::string_view> values[3];
+    std::vector<NodeHost> hosts;
+    std::map<std::pair<bool, std::string>, size_t> seen;  // key -> line first listed
+    std::vector<Finding> *findings;
+    size_t records = 0;
+
+    static int32_t on_value(void *c, idm::clmap::Attr attr, std::string_view v) {
+        auto *self = static_cast<Collector *>(c);
+        self->values[attr].push_back(v);
+        return 0;
+    }
+    static int32_t on_record(void *c) {
+        auto *self = static_cast<Collector *>(c);
+        self->store();
+        return 0;
+    }
+    size_t line_of(std::string_view v) const { return index->line_of(static_cast<size_t>(v.data() - text.data())); }
+
+    void store() {
+        ++records;
+        std::vector<std::string> clusters;
+        for (std::string_view c : values[idm::clmap::kClusters]) clusters.emplace_back(c);
+        for (int a = idm::clmap::kNames; a <= idm::clmap::kAddresses; ++a) {
+            bool address = a == idm::clmap::kAddresses;
+            for (std::string_view v : values[a]) {
+                size_t line = line_of(v);
+                auto [it, fresh] = seen.emplace(std::make_pair(address, std::string(v)), line);
+                if (!fresh) {
+                    findings->push_back({line, Severity::kWarning, "host-repeated",
+                                         std::string(address ? "address" : "host name") + " \"" + show(v) +
+                                             "\" is already listed at line " + std::to_string(it->second) +
+                                             ": the first record's clusters are used"});
+                    continue;
+                }
+                if (!address) {
+                    unsigned char buf[16];
+                    std::string s(v);
+                    if (inet_pton(AF_INET, s.c_str(), buf) == 1 || inet_pton(AF_INET6, s.c_str(), buf) == 1)
+                        findings->push_back({line, Severity::kWarning, "name-is-address",
+                                             "NAME value \"" + show(v) +
+                                                 "\" reads as an address: queries for it search only the "
+                                                 "ADDRESS values, so it is never found"});
+                }
+                if (keep) hosts.push_back({std::string(v), address, clusters, line});
+            }
+        }
+        for (auto &list : values) list.clear();
+    }
+};
+
+const char *point_reason(int point) {
+    switch (point) {
+        case 157: return "host record incomplete: it needs a CLUSTER value and a NAME or ADDRESS value";
+        case 164: return "NODE without ':' on its line";
+        case 165: return "NAME outside a host record (no NODE before it), or a second NAME line with values";
+        case 166: return "NAME without ':' on its line";
+        case 167: return "ADDRESS outside a host record (no NODE before it), or a second ADDRESS line with values";
+        case 168: return "ADDRESS without ':' on its line";
+        case 169: return "CLUSTER outside a host record (no NODE before it), or a second CLUSTER line with values";
+        case 170: return "CLUSTER without ':' on its line";
+        case 171: return "the statement begins with none of NODE, NAME, ADDRESS, CLUSTER";
+    }
+    return "invalid entry";
+}
+
+// Offset of the first line after `line` (1-based) whose statement is NODE.
+size_t next_node_statement(std::string_view text, const LineIndex &index, size_t line) {
+    for (size_t l = line; l < index.starts.size(); ++l) {
+        size_t p = index.starts[l];
+        while (p < text.size() && text[p] != '\n' && std::isspace(static_cast<unsigned char>(text[p]))) ++p;
+        if (p < text.size() && idm::clmap::keyword_of(text.substr(p)) == idm::clmap::Keyword::kNode) return p;
+    }
+    return std::string_view::npos;
+}
+
+// Statements whose keyword is longer than its name ("Nodes", "NAMES ="):
+// accepted by the library, worth a note.
+void keyword_notes(std::string_view text, const LineIndex &index, std::vector<Finding> &out) {
+    static constexpr std::pair<idm::clmap::Keyword, std::string_view> kWords[] = {
+        {idm::clmap::Keyword::kNode, "NODE"},
+        {idm::clmap::Keyword::kName, "NAME"},
+        {idm::clmap::Keyword::kAddress, "ADDRESS"},
+        {idm::clmap::Keyword::kCluster, "CLUSTER"}};
+    for (size_t l = 0; l < index.starts.size(); ++l) {
+        size_t p = index.starts[l];
+        size_t end = text.find('\n', p);
+        if (end == std::string_view::npos) end = text.size();
+        while (p < end && std::isspace(static_cast<unsigned char>(text[p]))) ++p;
+        if (p >= end || text[p] == '#') continue;
+        std::string_view stmt = text.substr(p, end - p);
+        idm::clmap::Keyword k = idm::clmap::keyword_of(stmt);
+        size_t colon = stmt.find(':');
+        if (k == idm::clmap::Keyword::kNone || colon == std::string_view::npos) continue;
+        std::string head = trim_blanks(stmt.substr(0, colon));
+        for (auto [kw, word] : kWords) {
+            if (kw == k && !same_ignoring_case(head, word))
+                out.push_back({l + 1, Severity::kNote, "keyword-prefix",
+                               "\"" + show(head) + "\" is read as the keyword " + std::string(word) +
+                                   " (only its first " + std::to_string(word.size()) + " characters count)"});
+        }
+        // Values that look like comments or hold tabs.
+        if (k != idm::clmap::Keyword::kNode) {
+            std::string_view list = stmt.substr(colon + 1);
+            size_t hash = list.find('#');
+            if (hash != std::string_view::npos &&
+                (hash == 0 || list[hash - 1] == ' ' || list[hash - 1] == '\t'))
+                out.push_back({l + 1, Severity::kWarning, "hash-value",
+                               "'#' after ':' is not a comment: it and what follows are stored as values"});
+            std::string_view trimmed = list;
+            while (!trimmed.empty() && std::isspace(static_cast<unsigned char>(trimmed.front()))) trimmed.remove_prefix(1);
+            while (!trimmed.empty() && std::isspace(static_cast<unsigned char>(trimmed.back()))) trimmed.remove_suffix(1);
+            if (trimmed.find('\t') != std::string_view::npos)
+                out.push_back({l + 1, Severity::kWarning, "tab-in-value",
+                               "a tab does not separate values: it is kept inside one"});
+        }
+    }
+}
+
+}  // namespace
+
+NodeinfoReport check_nodeinfo_text(std::string_view raw) {
+    NodeinfoReport report;
+    // The loader appends an LF; judge exactly that text.
+    std::string text(raw);
+    text += '\n';
+    LineIndex index(text);
+    report.lines = static_cast<size_t>(std::count(raw.begin(), raw.end(), '\n')) +
+                   (!raw.empty() && raw.back() != '\n' ? 1 : 0);
+    std::vector<Finding> warnings;
+
+    Collector first{text, &index, true, {}, {}, {}, &warnings, 0};
+    idm::clmap::ParseSink sink{&first, &Collector::on_value, &Collector::on_record};
+    idm::clmap::ParseResult r = idm::clmap::parse(text, sink);
+    report.records = first.records;
+    if (r.status == 0) {
+        report.hosts = std::move(first.hosts);
+    } else {
+        report.loads = false;
+        report.first_error_line = r.line;
+        report.findings.push_back({r.line, Severity::kError, "invalid-statement",
+                                   std::string(point_reason(r.point)) +
+                                       " (2650-690: the library loads nothing from this file)"});
+        // Further errors: resume at the next NODE statement after the fault.
+        size_t line = r.line;
+        for (int guard = 0; guard < 100000; ++guard) {
+            size_t from = next_node_statement(text, index, line);
+            if (from == std::string_view::npos) break;
+            std::string_view rest = std::string_view(text).substr(from);
+            Collector more{text, &index, false, {}, {}, {}, &warnings, 0};
+            idm::clmap::ParseSink more_sink{&more, &Collector::on_value, &Collector::on_record};
+            idm::clmap::ParseResult m = idm::clmap::parse(rest, more_sink);
+            if (m.status == 0) break;
+            size_t abs_line = index.line_of(from + m.offset);
+            report.findings.push_back({abs_line, Severity::kError, "invalid-statement",
+                                       std::string(point_reason(m.point)) + " (found after resuming at line " +
+                                           std::to_string(index.line_of(from)) + ")"});
+            if (abs_line <= line) break;
+            line = abs_line;
+        }
+    }
+    keyword_notes(text, index, warnings);
+    if (report.loads && report.hosts.empty())
+        warnings.push_back({0, Severity::kNote, "no-hosts", "lists no host: every cluster query answers -1"});
+    report.findings.insert(report.findings.end(), warnings.begin(), warnings.end());
+    std::stable_sort(report.findings.begin(), report.findings.end(),
+                     [](const Finding &a, const Finding &b) { return a.line < b.line; });
+    return report;
+}
+
+}  // namespace oxidm_tool::check
