@@ -9,6 +9,18 @@ set(OXIDM_INSTALL_MPMDIR ${CMAKE_INSTALL_LIBDIR}/oxidm/mpm)
 set(OXIDM_INSTALL_CMAKEDIR ${CMAKE_INSTALL_LIBDIR}/cmake/oxidm)
 set(OXIDM_INSTALL_PCDIR ${CMAKE_INSTALL_LIBDIR}/pkgconfig)
 
+# Installed objects find their neighbours wherever the tree is put: the
+# library and the checker next to the stand-ins, the plug-ins two levels up.
+set_target_properties(ox_idm PROPERTIES INSTALL_RPATH "$ORIGIN")
+foreach(plugin oxmpm_host oxmpm_principal)
+  if(TARGET ${plugin})
+    set_target_properties(${plugin} PROPERTIES INSTALL_RPATH "$ORIGIN/../..")
+  endif()
+endforeach()
+if(TARGET oxidm_check)
+  set_target_properties(oxidm_check PROPERTIES INSTALL_RPATH "$ORIGIN/..")
+endif()
+
 install(TARGETS ox_idm ox_cu ox_tr ox_mss EXPORT oxidmTargets
         LIBRARY DESTINATION ${CMAKE_INSTALL_LIBDIR} COMPONENT runtime NAMELINK_COMPONENT development
         INCLUDES DESTINATION ${OXIDM_INSTALL_INCLUDEDIR})

@@ -2,9 +2,16 @@
 # Installs the build tree into a scratch prefix, builds a consumer program
 # against it with pkg-config and with CMake's find_package, runs both, runs
 # the installed oxidm, and builds and inspects the Debian package.
-# Usage: test_install.sh BUILD_DIR SOURCE_DIR
+# Usage: test_install.sh BUILD_DIR SOURCE_DIR [SANITIZE]
+# SANITIZE is the build's OXIDM_SANITIZE: consumers of an instrumented
+# library are built with the same sanitizer.
 set -euo pipefail
-build=$1 src=$2
+build=$(cd "$1" && pwd) src=$(cd "$2" && pwd) sanitize=${3:-}
+case $sanitize in
+  address-undefined) cflags="-fsanitize=address,undefined" ;;
+  thread) cflags="-fsanitize=thread" ;;
+  *) cflags="" ;;
+esac
 work=$(mktemp -d)
 trap 'rm -rf "$work"' EXIT
 prefix=$work/prefix
@@ -35,14 +42,14 @@ check_output() {  # program
 # pkg-config
 export PKG_CONFIG_PATH=$prefix/$libdir/pkgconfig
 # shellcheck disable=SC2046
-cc -o "$work/consumer-pc" "$src/tests/tool/consumer/consumer.c" $(pkg-config --cflags --libs oxidm)
+cc $cflags -o "$work/consumer-pc" "$src/tests/tool/consumer/consumer.c" $(pkg-config --cflags --libs oxidm) 2>/dev/null
 check_output "$work/consumer-pc"
 echo "pkg-config consumer: ok"
 
 # CMake package
 cmake -S "$src/tests/tool/consumer" -B "$work/consumer-build" -G Ninja -DCMAKE_PREFIX_PATH="$prefix" \
-      -DCMAKE_BUILD_RPATH="$prefix/$libdir" >/dev/null
-cmake --build "$work/consumer-build" >/dev/null
+      -DCMAKE_BUILD_RPATH="$prefix/$libdir" -DCMAKE_C_FLAGS="$cflags" >/dev/null
+cmake --build "$work/consumer-build" >/dev/null 2>&1
 check_output "$work/consumer-build/consumer"
 echo "CMake consumer: ok"
 
