@@ -21,6 +21,7 @@
 // the I/O, the locking and the trace points.
 #include "oxidm_natfile.h"
 
+#include <malloc.h>
 #include <stdio_ext.h>
 
 #include <climits>
@@ -195,6 +196,15 @@ constexpr Candidate kCandidates[IDM_MAPFILE_COUNT] = {
     {"/var/ox/cfg/oxsec_map.global", 434},
     {"/opt/helvo/cfg/oxsec_map.global", 448},
 };
+
+// Trims the block under a finished entry list to the smallest multiple of 10
+// entries not below its count.  A failed trim keeps the larger block.
+void reserve_exactly(idm_entry_list &list) {
+    if (list.entries == nullptr || list.count < 1) return;
+    const size_t bytes = (static_cast<size_t>(list.count) + 9) / 10 * 10 * sizeof(idm_mapfile_entry);
+    if (malloc_usable_size(list.entries) < bytes + 10 * sizeof(idm_mapfile_entry)) return;
+    if (void *p = xrealloc(list.entries, bytes)) list.entries = static_cast<idm_mapfile_entry *>(p);
+}
 
 const char *name_of(const idm_mapfile_set *set, int32_t i) {
     return set->names != nullptr ? set->names[i] : nullptr;
@@ -501,19 +511,37 @@ int32_t idm__alloc_entries(int32_t count, idm_mapfile_entry **entries) {
     if (count < 0) return bad_param(23, "idm__alloc_entries", 59, 1, static_cast<uint32_t>(count));
     if (entries == nullptr) return bad_param(23, "idm__alloc_entries", 59, 2, 0);
     if (count % 10 != 0) return 0;
-    // Exactly ten more slots each time: the capacity is always the smallest
-    // multiple of 10 not below the count.  glibc grows a large block in place
-    // (or by remapping) in the common case, which keeps a long file linear.
+    // The list grows by ten slots: every tenth entry is one enlargement,
+    // with its own failure point and the size of count + 10 entries.  The
+    // block underneath grows geometrically, so that a long file costs linear
+    // copying whatever the allocator does with a block followed by the
+    // identifier copies; reserve_exactly() trims it when the list is handed
+    // over.
     const size_t bytes = (static_cast<size_t>(count) + 10) * sizeof(idm_mapfile_entry);
     int32_t bytes32 = static_cast<int32_t>(bytes);
     if (trace::diag_on()) trace::record_data(55, trace::i32(count), trace::i32(bytes32));
-    void *grown = count <= INT32_MAX - 10 ? xrealloc(*entries, bytes) : nullptr;
-    if (grown == nullptr) {
+    idm_mapfile_entry *array = *entries;
+    bool grown = false;
+    if (array != nullptr && malloc_usable_size(array) >= bytes) {
+#ifdef OXIDM_FAULT_INJECTION
+        grown = !fault_alloc_fires();  // the enlargement as a failure point of its own
+#else
+        grown = true;
+#endif
+    } else if (count <= INT32_MAX - 10) {
+        size_t reserve = (static_cast<size_t>(count) + count / 2 + 9) / 10 * 10;
+        if (reserve < static_cast<size_t>(count) + 10) reserve = static_cast<size_t>(count) + 10;
+        void *p = xrealloc(array, reserve * sizeof(idm_mapfile_entry));
+        if (p != nullptr) {
+            array = static_cast<idm_mapfile_entry *>(p);
+            grown = true;
+        }
+    }
+    if (!grown) {
         if (trace::error_on()) trace::record_data(61, trace::i32(bytes32));
         report(23, kMsg658, "idm_alloc_entries", bytes32);
         return 6;
     }
-    auto *array = static_cast<idm_mapfile_entry *>(grown);
     std::memset(array + count, 0, 10 * sizeof(idm_mapfile_entry));
     *entries = array;
     return 0;
@@ -776,6 +804,7 @@ int32_t idm__native_read_mapfiles(const char *mechanism, idm_mapfile_set **set, 
         files->flags[i] &= ~MF_REREAD;
     }
 
+    reserve_exactly(list);
     idm__native_release_entry_list(*count, *entries);
     *count = list.count;
     *entries = list.entries;
