@@ -131,6 +131,21 @@ Message current_message() {
     return m;
 }
 
+// A line as the terminal should show it: control characters escaped.
+std::string printable(const std::string &s) {
+    std::string out;
+    for (unsigned char c : s) {
+        if (c == '\r') out += "\\r";
+        else if (c == '\t') out += "\\t";
+        else if (c < 0x20 || c == 0x7f) {
+            char buf[8];
+            std::snprintf(buf, sizeof buf, "\\x%02x", c);
+            out += buf;
+        } else out += static_cast<char>(c);
+    }
+    return out;
+}
+
 // ---- what the parser's records say ----
 
 struct Piece {
@@ -389,7 +404,7 @@ Outcome map_one(const std::string &mnemonic, const std::string &identity) {
     }
     std::free(local.value);
     if (o.status != 0) {
-        o.error = flat(library_error());
+        o.error = library_error();
         if (o.error.empty()) o.error = "status " + std::to_string(o.status) + " (no message)";
     }
     for (const TraceRecord &r : captured_records(o.first_record))
@@ -525,7 +540,7 @@ int cmd_explain(Context &ctx, const Args &in) {
     std::string answer = o.granted ? "maps to \"" + o.local + "\""
                          : o.status == 0 ? (decided >= 0 ? "no local identity granted (a denial matched)"
                                                          : "no local identity granted (no line matched)")
-                                         : "error: " + o.error;
+                                         : "error: " + flat(o.error);
     auto where = [&](const Piece &p) { return p.file + ":" + std::to_string(p.line); };
 
     Json json;
@@ -543,7 +558,7 @@ int cmd_explain(Context &ctx, const Args &in) {
         std::printf("explain %s %s\n", mnemonic.c_str(), identity.c_str());
         for (const FileState &f : parse.files)
             std::printf("  file %-34s %s\n", f.path.c_str(),
-                        !f.present ? "absent" : f.in_use ? "read" : "present, not read (superseded)");
+                        !f.present ? "absent" : f.in_use ? "selected" : "present, not used (superseded)");
         if (parse.files.empty())
             std::printf("  (the map files were not read in this call)\n");
     }
@@ -557,7 +572,7 @@ int cmd_explain(Context &ctx, const Args &in) {
             json.end_object();
             if (!ctx.json)
                 std::printf("  %s: %s\n      ignored by the parser: invalid rule\n", where(l.where).c_str(),
-                            l.where.text.c_str());
+                            printable(l.where.text).c_str());
             continue;
         }
         bool denial = l.kind.rfind("Denial", 0) == 0;
@@ -584,11 +599,12 @@ int cmd_explain(Context &ctx, const Args &in) {
         }
         json.end_object();
         if (!ctx.json) {
-            std::printf("  %s: %s\n      %s%s\n", where(l.where).c_str(), l.where.text.c_str(), text.c_str(),
+            std::printf("  %s: %s\n      %s%s\n", where(l.where).c_str(), printable(l.where.text).c_str(),
+                        printable(text).c_str(),
                         static_cast<int>(k) == decided ? "   <== decides" : "");
             if (aligned && k < verdicts.size() && !verdicts[k].matched && !verdicts[k].rule_text.empty())
-                std::printf("      rule: %s\n      id:   %s\n", verdicts[k].rule_text.c_str(),
-                            verdicts[k].id_text.c_str());
+                std::printf("      rule: %s\n      id:   %s\n", printable(verdicts[k].rule_text).c_str(),
+                            printable(verdicts[k].id_text).c_str());
         }
     }
     json.end_array();
