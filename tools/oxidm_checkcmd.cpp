@@ -8,6 +8,7 @@
 
 #include <cerrno>
 #include <cstdio>
+#include <cstdlib>
 #include <cstring>
 #include <string>
 
@@ -83,6 +84,10 @@ void permission_findings(const std::string &path, std::vector<check::Finding> &o
     }
     std::string dir = path.find('/') == std::string::npos ? "." : path.substr(0, path.rfind('/'));
     if (dir.empty()) dir = "/";
+    if (char *real = realpath(dir.c_str(), nullptr)) {
+        dir = real;
+        std::free(real);
+    }
     if (stat(dir.c_str(), &st) == 0) {
         std::string who = writers(st);
         bool sticky = (st.st_mode & S_ISVTX) != 0;
