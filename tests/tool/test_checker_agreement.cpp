@@ -6,6 +6,7 @@
 // table says, and every text it rejects fails to load with 2650-690.
 #include <arpa/inet.h>
 
+#include <algorithm>
 #include <cstdio>
 #include <random>
 #include <string>
@@ -15,6 +16,7 @@
 #include "oxidm.h"
 #include "oxidm_check.h"
 #include "oxidm_natfile.h"
+#include "oxidm_natmap.h"
 
 namespace {
 
@@ -235,6 +237,46 @@ TEST_F(CheckerAgreement, NodeInformationLoadsAndAnswersAsTheCheckerSays) {
     EXPECT_GE(lines, 10000u);
     EXPECT_GT(loaded, 40u);
     EXPECT_GT(rejected, 40u);
+}
+
+// Every text over {a, b} of up to `max` characters, the empty one excluded.
+std::vector<std::string> texts(size_t max, const std::string &alphabet) {
+    std::vector<std::string> out, frontier{""};
+    for (size_t len = 1; len <= max; ++len) {
+        std::vector<std::string> next;
+        for (const std::string &t : frontier)
+            for (char c : alphabet) next.push_back(t + c);
+        out.insert(out.end(), next.begin(), next.end());
+        frontier = next;
+    }
+    return out;
+}
+
+// The shadowing warnings rest on the checker's copy of the one-wildcard
+// match: it must be the library's, and field_covers must never claim a
+// pattern covers another that matches a text the first does not.
+TEST(CheckerMatch, WildcardMatchIsTheLibrarysAndCoversIsSound) {
+    std::vector<std::string> patterns;
+    for (const std::string &t : texts(4, "ab*"))
+        if (std::count(t.begin(), t.end(), '*') <= 1) patterns.push_back(t);
+    std::vector<std::string> literal = texts(6, "ab");
+    for (const std::string &p : patterns)
+        for (const std::string &t : literal)
+            ASSERT_EQ(oxidm_tool::check::wildcard_match(p, t), idm::wildcard_match(p.c_str(), t.c_str()))
+                << "pattern " << p << " text " << t;
+    size_t covering = 0;
+    for (const std::string &outer : patterns)
+        for (const std::string &inner : patterns) {
+            if (!oxidm_tool::check::field_covers(outer, inner)) continue;
+            ++covering;
+            for (const std::string &t : literal) {
+                if (idm::wildcard_match(inner.c_str(), t.c_str())) {
+                    ASSERT_TRUE(idm::wildcard_match(outer.c_str(), t.c_str()))
+                        << outer << " said to cover " << inner << ", but " << t << " escapes it";
+                }
+            }
+        }
+    EXPECT_GT(covering, patterns.size());  // more than the identities
 }
 
 }  // namespace
