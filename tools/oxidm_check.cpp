@@ -8,6 +8,7 @@
 #include <arpa/inet.h>
 
 #include <algorithm>
+#include <cstdint>
 #include <map>
 #include <string>
 
@@ -264,33 +265,58 @@ MapfileReport check_mapfile_text(std::string_view text, const std::string *mecha
             if (std::count(f.begin(), f.end(), '*') > 1) return false;
         return true;
     };
+    // An earlier entry covers a later one field by field.  Literal entries
+    // can only cover their equals, found through a map; the few entries
+    // with a wildcard are compared pairwise.
+    auto key_of = [&](size_t i) {
+        std::string k = report.entries[i].mechanism + '\0' + (exact[i] ? "1" : "0");
+        for (const std::string &f : fields[i]) k += '\0' + f;
+        return k;
+    };
+    auto literal = [&](size_t i) {
+        for (const std::string &f : fields[i])
+            if (f.find('*') != std::string::npos) return false;
+        return true;
+    };
+    std::map<std::string, size_t> first_literal;  // key -> earliest entry
+    std::vector<size_t> wildcards;                // usable entries with a '*', in order
     for (size_t j = 0; j < report.entries.size(); ++j) {
         const MapEntry &d = report.entries[j];
         if (!usable(j)) continue;
-        for (size_t i = 0; i < j; ++i) {
+        size_t found = SIZE_MAX;
+        bool is_literal = literal(j);
+        if (is_literal) {
+            auto it = first_literal.find(key_of(j));
+            if (it != first_literal.end()) found = it->second;
+        }
+        for (size_t i : wildcards) {
+            if (i >= found) break;
             const MapEntry &e = report.entries[i];
-            if (e.mechanism != d.mechanism || exact[i] != exact[j] || !usable(i) ||
-                fields[i].size() != fields[j].size())
-                continue;
+            if (e.mechanism != d.mechanism || exact[i] != exact[j] || fields[i].size() != fields[j].size()) continue;
             bool covers = true;
             for (size_t k = 0; k < fields[i].size() && covers; ++k) covers = field_covers(fields[i][k], fields[j][k]);
-            if (!covers) continue;
-            std::string earlier = "line " + std::to_string(e.line) + " (" +
-                                  (e.kind == EntryKind::kDenial ? "!" + show(e.network_id)
-                                                                : show(e.network_id) + "=" + show(e.local_id)) +
-                                  ")";
-            if (d.kind == EntryKind::kDenial && e.kind == EntryKind::kAffirmative)
-                report.findings.push_back({d.line, Severity::kWarning, "dead-denial",
-                                           "this denial can never take effect: " + earlier +
-                                               " matches every identity it names first"});
-            else if (d.kind == EntryKind::kDenial)
-                report.findings.push_back({d.line, Severity::kNote, "redundant-denial",
-                                           "already denied by " + earlier});
-            else
-                report.findings.push_back({d.line, Severity::kNote, "shadowed-entry",
-                                           "never used: " + earlier + " matches every identity it names first"});
-            break;
+            if (covers) {
+                found = i;
+                break;
+            }
         }
+        if (is_literal) first_literal.emplace(key_of(j), j);
+        else wildcards.push_back(j);
+        if (found == SIZE_MAX) continue;
+        const MapEntry &e = report.entries[found];
+        std::string earlier = "line " + std::to_string(e.line) + " (" +
+                              (e.kind == EntryKind::kDenial ? "!" + show(e.network_id)
+                                                            : show(e.network_id) + "=" + show(e.local_id)) +
+                              ")";
+        if (d.kind == EntryKind::kDenial && e.kind == EntryKind::kAffirmative)
+            report.findings.push_back({d.line, Severity::kWarning, "dead-denial",
+                                       "this denial can never take effect: " + earlier +
+                                           " matches every identity it names first"});
+        else if (d.kind == EntryKind::kDenial)
+            report.findings.push_back({d.line, Severity::kNote, "redundant-denial", "already denied by " + earlier});
+        else
+            report.findings.push_back({d.line, Severity::kNote, "shadowed-entry",
+                                       "never used: " + earlier + " matches every identity it names first"});
     }
     std::stable_sort(report.findings.begin(), report.findings.end(),
                      [](const Finding &a, const Finding &b) { return a.line < b.line; });
