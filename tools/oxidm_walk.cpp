@@ -61,7 +61,6 @@ constexpr const char kMechanismsHelp[] =
 
 struct Call {
     bool has_entry = false;
-    uint32_t kind = 0;
     std::string network_id, local_id;
     size_t record_at = 0;              // trace records before the call
     unsigned long errors_before = 0;   // cu_set_error_1 calls before the translator ran
@@ -89,7 +88,6 @@ int32_t watched_translate(const idm_mapfile_entry *entry, const char *network_id
     }
     if (entry != nullptr) {
         c.has_entry = true;
-        c.kind = entry->kind;
         c.network_id = entry->network_id ? entry->network_id : "";
         c.local_id = entry->local_id ? entry->local_id : "";
     }
@@ -235,7 +233,6 @@ ParseView read_parse_records(const std::vector<TraceRecord> &records) {
 
 struct Verdict {
     int32_t translator_status = 0;
-    bool translated_now = false;     // the translator got the entry (not a cached rule)
     int check_rule = -1, check_id = -1, apply = -1;  // statuses, -1 when not run
     bool matched = false;
     std::string result;              // local identity from record 133, "" for none
@@ -514,7 +511,6 @@ int cmd_explain(Context &ctx, const Args &in) {
         size_t b = k + 1 < o.end_call ? g_watch.calls[k + 1].record_at - from : records.size();
         Verdict v = read_walk_records(slice(c.record_at - from, b));
         v.translator_status = c.status;
-        v.translated_now = c.has_entry;
         // The library keeps one current error: the one current when the next
         // call began (or at the end) was reported while this entry was handled.
         if (k + 1 < o.end_call) {
@@ -529,9 +525,12 @@ int cmd_explain(Context &ctx, const Args &in) {
     bool aligned = true;
     for (size_t k = 0; k < verdicts.size(); ++k) {
         const Call &c = g_watch.calls[o.first_call + k];
-        if (k >= parse.entry_line.size() || !c.has_entry ||
-            parse.lines[static_cast<size_t>(parse.entry_line[k])].network_id != c.network_id)
+        if (k >= parse.entry_line.size() || !c.has_entry) {
             aligned = false;
+            continue;
+        }
+        const ParsedLine &l = parse.lines[static_cast<size_t>(parse.entry_line[k])];
+        if (l.network_id != c.network_id || l.local_id != c.local_id) aligned = false;
     }
     int decided = -1;  // entry index that ended the walk with a match
     if (o.status == 0 && !verdicts.empty() && verdicts.back().matched) decided = static_cast<int>(verdicts.size()) - 1;
