@@ -251,10 +251,15 @@ size_t suggested_size(int which) {
     return static_cast<size_t>(n > 0 ? n : kUnsuggestedSize);
 }
 
-// The error number of a failed getgrent_r.  glibc returns it as the result
-// and may leave errno alone; an interposed database may return -1 and set
-// errno instead.  A positive result is the error number; otherwise errno,
-// which the caller cleared before the call, holds it (0: nothing failed).
+// The error number of a failed getgrent_r, the number the scan acts on
+// (EINTR: call again; 0 or ENOENT: complete; else 2650-700).  The caller
+// clears errno before each call, as the scan is defined in terms of errno,
+// but glibc's getgrent_r returns the error number as its result (ENOENT at
+// the end of the database) and need not set errno; an NSS layer preloaded in
+// front of it may instead return -1 and set errno.  So a positive result is
+// the error number, and otherwise errno is (still 0 when nothing was set).
+// getpwnam_r and getgrgid_r need no such reading: any non-zero result or a
+// missing entry fails their lookup alike.
 int enumeration_error(int result) { return result > 0 ? result : errno; }
 
 // Holds the group-scan mutex for one enumeration; the destructor (normal
