@@ -27,6 +27,6 @@ run --root examples explain princ joe/root@EXAMPLE.ORG
 run --root examples groups root
 run --root examples cluster any node2 192.0.2.13 unknown.example.org
 run --root examples cluster active node1 node3
-run check mapfile examples/var/ox/cfg/oxsec_map.local
-run check nodeinfo examples/var/ox/cfg/oxsec.nodeinfo
+run --root examples check
+run check mapfile examples/mistakes.map
 run --root examples trace --levels API=1 cluster any node1

@@ -148,6 +148,81 @@ bool field_covers(std::string_view outer, std::string_view inner) {
 // Map files
 // ---------------------------------------------------------------------------
 
+void shadowing(const std::vector<MapEntry> &earlier, const std::string &earlier_file,
+               const std::vector<MapEntry> &later, const FieldSplitter &split, std::vector<Finding> &out) {
+    // One sequence in walk order: the earlier file's entries, then these.
+    std::vector<const MapEntry *> all;
+    for (const MapEntry &e : earlier) all.push_back(&e);
+    for (const MapEntry &e : later) all.push_back(&e);
+    size_t first_reported = earlier.size();
+    std::vector<std::vector<std::string>> fields(all.size());
+    std::vector<bool> exact(all.size());
+    for (size_t i = 0; i < all.size(); ++i) {
+        exact[i] = split && split(*all[i], fields[i]);
+        if (!exact[i]) fields[i] = {all[i]->network_id};
+    }
+    auto usable = [&](size_t i) {
+        for (const std::string &f : fields[i])
+            if (std::count(f.begin(), f.end(), '*') > 1) return false;
+        return true;
+    };
+    // An earlier entry covers a later one field by field.  Literal entries
+    // can only cover their equals, found through a map; the few entries
+    // with a wildcard are compared pairwise.
+    auto key_of = [&](size_t i) {
+        std::string k = all[i]->mechanism + '\0' + (exact[i] ? "1" : "0");
+        for (const std::string &f : fields[i]) k += '\0' + f;
+        return k;
+    };
+    auto literal = [&](size_t i) {
+        for (const std::string &f : fields[i])
+            if (f.find('*') != std::string::npos) return false;
+        return true;
+    };
+    std::map<std::string, size_t> first_literal;  // key -> earliest entry
+    std::vector<size_t> wildcards;                // usable entries with a '*', in order
+    for (size_t j = 0; j < all.size(); ++j) {
+        const MapEntry &d = *all[j];
+        if (!usable(j)) continue;
+        size_t found = SIZE_MAX;
+        bool is_literal = literal(j);
+        if (is_literal) {
+            auto it = first_literal.find(key_of(j));
+            if (it != first_literal.end()) found = it->second;
+        }
+        for (size_t i : wildcards) {
+            if (i >= found) break;
+            const MapEntry &e = *all[i];
+            if (e.mechanism != d.mechanism || exact[i] != exact[j] || fields[i].size() != fields[j].size()) continue;
+            bool covers = true;
+            for (size_t k = 0; k < fields[i].size() && covers; ++k) covers = field_covers(fields[i][k], fields[j][k]);
+            if (covers) {
+                found = i;
+                break;
+            }
+        }
+        if (is_literal) first_literal.emplace(key_of(j), j);
+        else wildcards.push_back(j);
+        if (found == SIZE_MAX || j < first_reported) continue;
+        const MapEntry &e = *all[found];
+        std::string earlier_line = (found < first_reported ? earlier_file + ":" + std::to_string(e.line)
+                                                           : "line " + std::to_string(e.line)) +
+                                   " (" +
+                                   (e.kind == EntryKind::kDenial ? "!" + show(e.network_id)
+                                                                 : show(e.network_id) + "=" + show(e.local_id)) +
+                                   ")";
+        if (d.kind == EntryKind::kDenial && e.kind == EntryKind::kAffirmative)
+            out.push_back({d.line, Severity::kWarning, "dead-denial",
+                           "this denial can never take effect: " + earlier_line +
+                               " matches every identity it names first"});
+        else if (d.kind == EntryKind::kDenial)
+            out.push_back({d.line, Severity::kNote, "redundant-denial", "already denied by " + earlier_line});
+        else
+            out.push_back({d.line, Severity::kNote, "shadowed-entry",
+                           "never used: " + earlier_line + " matches every identity it names first"});
+    }
+}
+
 MapfileReport check_mapfile_text(std::string_view text, const std::string *mechanism,
                                  const std::function<bool(const std::string &)> &is_uid0,
                                  const FieldSplitter &split, const std::vector<std::string> *known) {
@@ -248,76 +323,14 @@ MapfileReport check_mapfile_text(std::string_view text, const std::string *mecha
 
     // Entries that grant a privileged account to a wildcard, and entries that
     // an earlier entry of the same mechanism shadows.
-    std::vector<std::vector<std::string>> fields(report.entries.size());
-    std::vector<bool> exact(report.entries.size());
-    for (size_t i = 0; i < report.entries.size(); ++i) {
-        const MapEntry &e = report.entries[i];
-        exact[i] = split && split(e, fields[i]);
-        if (!exact[i]) fields[i] = {e.network_id};
+    for (const MapEntry &e : report.entries) {
         if (e.kind == EntryKind::kAffirmative && e.network_id.find('*') != std::string::npos &&
             (e.local_id == "root" || (is_uid0 && is_uid0(e.local_id))))
             report.findings.push_back({e.line, Severity::kWarning, "wildcard-root",
                                        "the wildcard identifier \"" + show(e.network_id) +
                                            "\" maps to \"" + show(e.local_id) + "\", an account with uid 0"});
     }
-    auto usable = [&](size_t i) {
-        for (const std::string &f : fields[i])
-            if (std::count(f.begin(), f.end(), '*') > 1) return false;
-        return true;
-    };
-    // An earlier entry covers a later one field by field.  Literal entries
-    // can only cover their equals, found through a map; the few entries
-    // with a wildcard are compared pairwise.
-    auto key_of = [&](size_t i) {
-        std::string k = report.entries[i].mechanism + '\0' + (exact[i] ? "1" : "0");
-        for (const std::string &f : fields[i]) k += '\0' + f;
-        return k;
-    };
-    auto literal = [&](size_t i) {
-        for (const std::string &f : fields[i])
-            if (f.find('*') != std::string::npos) return false;
-        return true;
-    };
-    std::map<std::string, size_t> first_literal;  // key -> earliest entry
-    std::vector<size_t> wildcards;                // usable entries with a '*', in order
-    for (size_t j = 0; j < report.entries.size(); ++j) {
-        const MapEntry &d = report.entries[j];
-        if (!usable(j)) continue;
-        size_t found = SIZE_MAX;
-        bool is_literal = literal(j);
-        if (is_literal) {
-            auto it = first_literal.find(key_of(j));
-            if (it != first_literal.end()) found = it->second;
-        }
-        for (size_t i : wildcards) {
-            if (i >= found) break;
-            const MapEntry &e = report.entries[i];
-            if (e.mechanism != d.mechanism || exact[i] != exact[j] || fields[i].size() != fields[j].size()) continue;
-            bool covers = true;
-            for (size_t k = 0; k < fields[i].size() && covers; ++k) covers = field_covers(fields[i][k], fields[j][k]);
-            if (covers) {
-                found = i;
-                break;
-            }
-        }
-        if (is_literal) first_literal.emplace(key_of(j), j);
-        else wildcards.push_back(j);
-        if (found == SIZE_MAX) continue;
-        const MapEntry &e = report.entries[found];
-        std::string earlier = "line " + std::to_string(e.line) + " (" +
-                              (e.kind == EntryKind::kDenial ? "!" + show(e.network_id)
-                                                            : show(e.network_id) + "=" + show(e.local_id)) +
-                              ")";
-        if (d.kind == EntryKind::kDenial && e.kind == EntryKind::kAffirmative)
-            report.findings.push_back({d.line, Severity::kWarning, "dead-denial",
-                                       "this denial can never take effect: " + earlier +
-                                           " matches every identity it names first"});
-        else if (d.kind == EntryKind::kDenial)
-            report.findings.push_back({d.line, Severity::kNote, "redundant-denial", "already denied by " + earlier});
-        else
-            report.findings.push_back({d.line, Severity::kNote, "shadowed-entry",
-                                       "never used: " + earlier + " matches every identity it names first"});
-    }
+    shadowing({}, "", report.entries, split, report.findings);
     std::stable_sort(report.findings.begin(), report.findings.end(),
                      [](const Finding &a, const Finding &b) { return a.line < b.line; });
     return report;

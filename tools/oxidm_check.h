@@ -67,6 +67,13 @@ MapfileReport check_mapfile_text(std::string_view text, const std::string *mecha
                                  const std::function<bool(const std::string &)> &is_uid0 = {},
                                  const FieldSplitter &split = {}, const std::vector<std::string> *known = nullptr);
 
+// Adds to `out` a finding for every entry of `later` that an entry before
+// it shadows: an entry of `earlier` (a file the library reads first, named
+// `earlier_file` in the messages) or an earlier entry of `later` itself.
+// check_mapfile_text runs it with no earlier file.
+void shadowing(const std::vector<MapEntry> &earlier, const std::string &earlier_file,
+               const std::vector<MapEntry> &later, const FieldSplitter &split, std::vector<Finding> &out);
+
 // ---- node information file ----
 
 struct NodeHost {

@@ -345,6 +345,26 @@ def _():
         shutil.rmtree(d)
 
 
+@case("check config: every file the library would read, in its order")
+def _():
+    doc = json_of(EX + ["check"], 0)
+    used = {f["file"]: f["used"] for f in doc["files"]}
+    expect(used == {"/var/ox/cfg/oxsec_map.local": True, "/var/ox/cfg/oxsec_map.global": True,
+                    "/opt/helvo/cfg/oxsec_map.global": False, "/var/ox/cfg/oxsec.nodeinfo": True}, f"{used}")
+    expect(doc["active_cluster"] == "prod", "active cluster")
+    root = make_root({"var/ox/cfg/oxsec_map.local": "princ:*@*=x\n",
+                      "var/ox/cfg/oxsec_map.global": "princ:!a@R\nprinc:bad\n"})
+    try:
+        doc = json_of(["--root", root, "check"], 1)
+        glob = [f for f in doc["files"] if f["file"] == "/var/ox/cfg/oxsec_map.global"][0]
+        codes = {(f["line"], f["code"]) for f in glob["findings"]}
+        expect({(1, "dead-denial"), (2, "invalid-rule")} <= codes, f"{codes}")
+        expect(doc["active_cluster"] is None and doc["errors"] == 1, "summary")
+        expect_run(["--root", root, "check", "config", "--mech", "princ"], 2)
+    finally:
+        shutil.rmtree(root)
+
+
 # ---- trace ----
 
 
