@@ -36,6 +36,7 @@ constexpr const char kUsage[] =
     "  cluster any|active HOST...   whether hosts are in a known cluster / the active cluster\n"
     "  check mapfile FILE [--mech MECH]\n"
     "  check nodeinfo FILE          every line the library would ignore or reject, and warnings\n"
+    "  check [config]               every file the library would read now, in its order\n"
     "  trace [--levels L] COMMAND...   run a command with tracing on and print the records\n"
     "  trace decode FILE            decode a trace file written through OX_TR_FILE\n"
     "  mechanisms                   the sample mechanisms this command knows\n"
