@@ -97,9 +97,12 @@ uint32_t bare_pass(size_t pw_size, size_t gr_size) {
     group grp;
     group *found = nullptr;
     uint32_t count = 0;
+    std::string primary;  // the primary group is passed over by name, as in the library
     if (getpwnam_r(kUser, &pwd, pw_buffer, 2 * pw_size, &user) == 0 && user != nullptr &&
-        getgrgid_r(pwd.pw_gid, &grp, gr_buffer, gr_size, &found) == 0 && found != nullptr)
+        getgrgid_r(pwd.pw_gid, &grp, gr_buffer, gr_size, &found) == 0 && found != nullptr) {
         count = 1;
+        primary = grp.gr_name;
+    }
     std::free(gr_buffer);
     std::free(pw_buffer);
     if (count == 0) return 0;
@@ -108,7 +111,7 @@ uint32_t bare_pass(size_t pw_size, size_t gr_size) {
     for (;;) {
         found = nullptr;
         if (getgrent_r(&grp, scan_buffer, gr_size, &found) != 0 || found == nullptr) break;
-        if (grp.gr_gid == kPrimaryGid || grp.gr_mem == nullptr) continue;
+        if (std::strcmp(grp.gr_name, primary.c_str()) == 0 || grp.gr_mem == nullptr) continue;
         for (char **m = grp.gr_mem; *m != nullptr; ++m)
             if (std::strcmp(*m, kUser) == 0) ++count;
     }
