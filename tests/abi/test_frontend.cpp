@@ -198,7 +198,10 @@ TEST_F(FrontEnd, Level8ItemsOfRegistration) {
     oxtest::set_trace_levels(0, 8, 0, 0, 0);
     EXPECT_EQ(sec_idm_register_translator(2, nullptr, translator_a, cleanup_a), 4);
     auto r = trace_records();
-    ASSERT_EQ(r.size(), 2u);
+    // The first front-end call initialises the library, which sets up the
+    // cluster map (bare ids 148 and 149 at API level 1 or 8).
+    ASSERT_EQ(oxtest::trace_ids(), (std::vector<int>{90, 148, 149, 92}));
+    r.erase(r.begin() + 1, r.begin() + 3);
     EXPECT_EQ(r[0].id, 90);
     ASSERT_EQ(r[0].items.size(), 4u);
     EXPECT_EQ(r[0].i32(0), 2);
@@ -213,8 +216,9 @@ TEST_F(FrontEnd, Level8ItemsOfRegistration) {
 }
 
 TEST_F(FrontEnd, Level8ItemsOfMappingAndGroups) {
-    oxtest::set_trace_levels(0, 8, 0, 0, 0);
     idm_buffer out;
+    sec_idm_map_identity(nullptr, nullptr, nullptr);  // initialisation, untraced
+    oxtest::set_trace_levels(0, 8, 0, 0, 0);
     EXPECT_EQ(sec_idm_map_identity("m", nullptr, &out), 4);
     uint32_t count;
     idm_buffer *list;
