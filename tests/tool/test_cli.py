@@ -216,6 +216,23 @@ def _():
         shutil.rmtree(root)
 
 
+@case("explain: line numbers across a line longer than 1023 characters")
+def _():
+    long_line = "princ:" + "a" * 1500 + "@R=x"
+    root = make_root({"var/ox/cfg/oxsec_map.local": "# head\n" + long_line + "\nprinc:!c@R\nprinc:*@R=y\n"})
+    try:
+        doc = json_of(["--root", root, "explain", "princ", "b@R"], 0)
+        expect(doc["decided_by"]["line"] == 4 and doc["local"] == "y", f"decided_by {doc['decided_by']}")
+        by_line = {l["line"]: l for l in doc["lines"]}
+        expect(by_line[2]["verdict"] == "ignored", f"the long line's first piece: {by_line.get(2)}")
+        expect(by_line[3]["kind"] == "denial", f"line 3: {by_line.get(3)}")
+        check = json_of(["--root", root, "check"], 1)
+        codes = {(f["line"], f["code"]) for f in check["files"][0]["findings"]}
+        expect({(2, "long-line"), (2, "invalid-rule")} <= codes, f"{codes}")
+    finally:
+        shutil.rmtree(root)
+
+
 @case("explain: no map file at all")
 def _():
     root = make_root({})
