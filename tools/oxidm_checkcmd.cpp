@@ -2,6 +2,7 @@
 // walk and the verdicts are in liboxidm-check (oxidm_check.cpp); this part
 // adds what needs the system: file ownership and modes, the user database
 // for uid-0 accounts, the mechanisms' translators for exact field matching.
+#include <fcntl.h>
 #include <pwd.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -55,9 +56,23 @@ constexpr const char kCheckHelp[] =
     "2 the file cannot be read.\n";
 
 bool read_file(const std::string &path, std::string &out, std::string &error) {
-    FILE *f = std::fopen(path.c_str(), "re");
+    // Only regular files: a device or a pipe could be endless or block
+    // (opened without waiting, so that a FIFO cannot hold the command).
+    int fd = open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK);
+    if (fd < 0) {
+        error = path + ": " + std::strerror(errno);
+        return false;
+    }
+    struct stat st;
+    if (fstat(fd, &st) != 0 || !S_ISREG(st.st_mode)) {
+        close(fd);
+        error = path + ": not a regular file";
+        return false;
+    }
+    FILE *f = fdopen(fd, "r");
     if (f == nullptr) {
         error = path + ": " + std::strerror(errno);
+        close(fd);
         return false;
     }
     char buf[65536];

@@ -334,6 +334,9 @@ def _():
         codes = {f["code"] for f in doc["findings"]}
         expect({"file-writable", "directory-writable", "wildcard-root", "shadowed-entry"} <= codes, f"{codes}")
         expect_run(["check", "mapfile", os.path.join(d, "missing")], 2)
+        expect_run(["check", "mapfile", "/dev/zero"], 2, err="not a regular file")
+        os.mkfifo(os.path.join(d, "fifo"))
+        expect_run(["check", "nodeinfo", os.path.join(d, "fifo")], 2, err="not a regular file")
     finally:
         shutil.rmtree(d)
 
