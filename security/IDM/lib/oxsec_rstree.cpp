@@ -80,6 +80,9 @@ void rst_array_recurse(const rst_node *n, void **array, uint32_t capacity, uint3
 void rst_clean_recurse(rst_tree *tree, rst_node **link) {
     rst_node *n = *link;
     if (n == nullptr) return;
+    __builtin_prefetch(n->left);
+    __builtin_prefetch(n->right);
+    __builtin_prefetch(n->object);
     rst_clean_recurse(tree, &n->left);
     rst_clean_recurse(tree, &n->right);
     tree->rst_cleanup(n->object);
