@@ -331,11 +331,16 @@ std::string describe(const Verdict &v, bool denial) {
     auto with_message = [&](const std::string &what) {
         return v.message.text.empty() ? what : what + ": " + short_message(v.message.text);
     };
-    if (v.translator_status == 31) return with_message("the translator stopped the walk (status 31)");
-    if (v.translator_status != 0) {
-        std::string what = "the translator refused the entry (status " + std::to_string(v.translator_status) + ")";
-        if (v.translator_status == 38 || v.translator_status == 39) what += "; its rule is not used again";
-        return with_message(what);
+    switch (v.translator_status) {
+        case 0: break;
+        case 31: return with_message("the translator stopped the walk (status 31)");
+        case 38: return with_message("the translator rejected the identity or the line (status 38)");
+        case 39:
+            return with_message("the translator refused the line (status 39): not tried again until the map "
+                                "files change");
+        default:
+            return "the translator answered status " + std::to_string(v.translator_status) +
+                   ": the line is passed over this time";
     }
     if (v.matched) return denial ? "matches: a denial, no local identity granted" : "matches: maps to \"" + v.result + "\"";
     if (v.check_rule > 0) return with_message("invalid rule");
@@ -402,7 +407,9 @@ Outcome map_one(const std::string &mnemonic, const std::string &identity) {
     std::free(local.value);
     if (o.status != 0) {
         o.error = library_error();
-        if (o.error.empty()) o.error = "status " + std::to_string(o.status) + " (no message)";
+        if (o.error.empty())
+            o.error = "the mechanism's translator answered status " + std::to_string(o.status) +
+                      " (the library reported no message)";
     }
     for (const TraceRecord &r : captured_records(o.first_record))
         if (r.id == 131 || r.id == 133) o.matched = true;
@@ -601,9 +608,12 @@ int cmd_explain(Context &ctx, const Args &in) {
             std::printf("  %s: %s\n      %s%s\n", where(l.where).c_str(), printable(l.where.text).c_str(),
                         printable(text).c_str(),
                         static_cast<int>(k) == decided ? "   <== decides" : "");
-            if (aligned && k < verdicts.size() && !verdicts[k].matched && !verdicts[k].rule_text.empty())
-                std::printf("      rule: %s\n      id:   %s\n", printable(verdicts[k].rule_text).c_str(),
-                            printable(verdicts[k].id_text).c_str());
+            if (aligned && k < verdicts.size() && !verdicts[k].matched) {
+                if (!verdicts[k].rule_text.empty())
+                    std::printf("      rule: %s\n", printable(verdicts[k].rule_text).c_str());
+                if (!verdicts[k].id_text.empty())
+                    std::printf("      id:   %s\n", printable(verdicts[k].id_text).c_str());
+            }
         }
     }
     json.end_array();
