@@ -27,6 +27,36 @@ constexpr size_t kLineCut = 252;                // characters before the "..."
 inline bool nonempty(const char *s) { return s != nullptr && *s != '\0'; }
 inline const char *or_null(const char *s) { return nonempty(s) ? s : kTraceNull; }
 
+// Exact comparison of two short texts (registry types): cheaper inline than
+// a library call for the few bytes they hold.
+inline bool same_text(const char *a, const char *b) {
+    while (*a == *b) {
+        if (*a == '\0') return true;
+        ++a;
+        ++b;
+    }
+    return false;
+}
+
+// Entry and exit points of the two checks.  At API level 8 the entry record
+// is followed by the dump of the structure; the level is read once for both.
+template <class T>
+[[gnu::always_inline]] inline void enter(const trace::ApiIds &ids, T *p, void (*dump)(const T *)) {
+    unsigned char l = trace::level(trace::kApi);
+    if (l == 1) {
+        trace::record_id(ids.entry);
+    } else if (l == 8) {
+        trace::record_data(ids.entry_data, trace::ptr(p));
+        dump(p);
+    }
+}
+[[gnu::always_inline]] inline int32_t leave(const trace::ApiIds &ids, int32_t status) {
+    unsigned char l = trace::level(trace::kApi);
+    if (l == 1) trace::record_id(ids.exit);
+    else if (l == 8) trace::record_data(ids.exit_data, trace::i32(status));
+    return status;
+}
+
 // Number of '*' in s, stopping at 2: only "none", "one" and "more" matter.
 inline int stars(const char *s) {
     int n = 0;
@@ -58,17 +88,25 @@ void token_line(char (&line)[kLineBuffer], int32_t count, char *const *tokens) {
 namespace idm {
 
 bool wildcard_match(const char *pattern, const char *text) {
-    const char *star = std::strchr(pattern, IDM_WILDCARD);
-    if (star == nullptr) return std::strcmp(pattern, text) == 0;
-    const char *suffix = star + 1;
-    size_t prefix_len = static_cast<size_t>(star - pattern);
+    // One pass over the literal prefix: the texts compared here are short,
+    // and most comparisons end at their first characters.
+    const char *p = pattern;
+    const char *t = text;
+    while (*p != IDM_WILDCARD && *p != '\0' && *p == *t) {
+        ++p;
+        ++t;
+    }
+    if (*p != IDM_WILDCARD) return *p == '\0' && *t == '\0';  // no '*': equal texts only
+    // The text begins with the prefix F before the first '*'.
+    const char *suffix = p + 1;
+    if (*suffix == '\0') return true;  // "*" or "F*"
     size_t suffix_len = std::strlen(suffix);
-    if (prefix_len == 0 && suffix_len == 0) return true;
-    if (prefix_len == 0) return idm__strncmpr(suffix, text, static_cast<uint32_t>(suffix_len)) == 0;
-    if (suffix_len == 0) return std::strncmp(pattern, text, prefix_len) == 0;
-    // F*S: the length test keeps F and S from overlapping inside the text.
-    return prefix_len + 1 + suffix_len <= std::strlen(text) + 1 && std::strncmp(pattern, text, prefix_len) == 0 &&
-           idm__strncmpr(suffix, text, static_cast<uint32_t>(suffix_len)) == 0;
+    if (p != pattern) {
+        // F*S: the length test keeps F and S from overlapping inside the text.
+        size_t prefix_len = static_cast<size_t>(p - pattern);
+        if (prefix_len + 1 + suffix_len > std::strlen(text) + 1) return false;
+    }
+    return idm__strncmpr(suffix, text, static_cast<uint32_t>(suffix_len)) == 0;
 }
 
 }  // namespace idm
@@ -119,11 +157,10 @@ int32_t idm__native_match_token(const char *rule_token, const char *id_token) {
 
 int32_t idm__native_check_rule(idm_rule *rule) {
     static constexpr trace::ApiIds kIds{118, 120, 121, 122};
-    trace::Api api(kIds, trace::ptr(rule));
-    if (trace::level(trace::kApi) == 8) idm__trace_native_rule(rule);
+    enter<idm_rule>(kIds, rule, idm__trace_native_rule);
 
     uint32_t low = rule->rule_state & kLowHalf;
-    if (low == IDM_RULE_VALID) return api.leave(0);
+    if (low == IDM_RULE_VALID) return leave(kIds, 0);
     if (low == IDM_RULE_UNCHECKED) {
         auto flag = [rule](uint32_t f) { rule->rule_state |= f; };
         if (!nonempty(rule->rgy_type) || !nonempty(rule->rgy)) flag(IDM_RULE_BAD_RGY);
@@ -150,7 +187,7 @@ int32_t idm__native_check_rule(idm_rule *rule) {
         if ((rule->rule_state & kLowHalf) == 0) {
             if (mapping == nullptr || rule->rule_state != 0) {
                 rule->rule_state = IDM_RULE_VALID;
-                return api.leave(0);
+                return leave(kIds, 0);
             }
             const char *value = mapping->value;
             if (std::strcmp(value, "*") == 0) {
@@ -175,27 +212,26 @@ int32_t idm__native_check_rule(idm_rule *rule) {
                     rule->rule_state = IDM_RULE_AMBIGUOUS;
                 } else {
                     rule->rule_state = static_cast<uint32_t>(at) * kPositionUnit + IDM_RULE_VALID;
-                    return api.leave(0);
+                    return leave(kIds, 0);
                 }
             } else if (std::strchr(value, IDM_WILDCARD) != nullptr) {
                 rule->rule_state = IDM_RULE_AMBIGUOUS;
             } else {
                 rule->rule_state = IDM_RULE_VALID;
-                return api.leave(0);
+                return leave(kIds, 0);
             }
         }
     }
-    return api.leave(report(38, kMsg662));
+    return leave(kIds, report(38, kMsg662));
 }
 
 int32_t idm__native_check_id(idm_id *id) {
     static constexpr trace::ApiIds kIds{123, 125, 126, 127};
-    trace::Api api(kIds, trace::ptr(id));
-    if (trace::level(trace::kApi) == 8) idm__trace_native_id(id);
+    enter<idm_id>(kIds, id, idm__trace_native_id);
     int32_t status = 0;
     if (!nonempty(id->rgy_type) || !nonempty(id->rgy) || id->token_cnt <= 0 || id->tokens == nullptr)
         status = report(38, kMsg665);
-    return api.leave(status);
+    return leave(kIds, status);
 }
 
 // ---------------------------------------------------------------------------
@@ -235,7 +271,7 @@ int32_t idm__native_apply_rule(idm_rule *rule, idm_id *id, idm_buffer *result) {
     if (int32_t s = idm__native_check_id(id); s != 0) return api.leave(s);
     if (rule->token_cnt != id->token_cnt)
         return api.leave(report(38, kMsg664, static_cast<int>(rule->token_cnt), static_cast<int>(id->token_cnt)));
-    if (std::strcmp(rule->rgy_type, id->rgy_type) != 0) return api.leave(report(38, kMsg663));
+    if (!same_text(rule->rgy_type, id->rgy_type)) return api.leave(report(38, kMsg663));
     if (int32_t s = idm__native_match_rgy(rule->rgy, id->rgy); s != 0) return api.leave(s);
     for (int32_t i = 0; i < rule->token_cnt; ++i)
         if (int32_t s = idm__native_match_token(rule->tokens[i], id->tokens[i]); s != 0) return api.leave(s);
