@@ -3,6 +3,9 @@
 // comments only at a statement's start, record completeness, and the fault
 // point, offset and line of every kind of invalid text.  Also the value
 // extraction and record routines that the loader builds on.
+#include <cctype>
+#include <cstring>
+#include <random>
 #include <string>
 #include <vector>
 
@@ -288,3 +291,182 @@ TEST_F(ClusterRoutines, CompareIsExactAndFreeArraysNullsEntries) {
 }
 
 }  // namespace
+
+// ---- a reference parser, written line by line with plain string
+// operations, against which the real one is swept over random texts ----
+
+namespace oracle {
+
+bool space(char c) { return std::isspace(static_cast<unsigned char>(c)) != 0; }
+
+bool starts_with_keyword(const std::string &s, const std::string &kw) {
+    if (s.size() < kw.size()) return false;
+    for (size_t i = 0; i < kw.size(); ++i) {
+        char c = s[i];
+        if (c >= 'a' && c <= 'z') c = static_cast<char>(c - 'a' + 'A');
+        if (c != kw[i]) return false;
+    }
+    return true;
+}
+
+// Splits at blanks, trims whitespace, drops empty fields.
+std::vector<std::string> values(const std::string &rest) {
+    std::vector<std::string> out;
+    size_t start = 0;
+    while (start <= rest.size()) {
+        size_t blank = rest.find(' ', start);
+        std::string field = rest.substr(start, blank == std::string::npos ? std::string::npos : blank - start);
+        size_t b = 0, e = field.size();
+        while (b < e && space(field[b])) ++b;
+        while (e > b && space(field[e - 1])) --e;
+        if (e > b) out.push_back(field.substr(b, e - b));
+        if (blank == std::string::npos) break;
+        start = blank + 1;
+    }
+    return out;
+}
+
+struct Result {
+    int32_t status = 0;
+    int point = 0;
+    size_t line = 0;
+    std::vector<std::string> records;
+};
+
+Result parse(const std::string &text) {
+    Result r;
+    std::vector<std::string> lines;
+    size_t from = 0;
+    for (;;) {
+        size_t lf = text.find('\n', from);
+        lines.push_back(text.substr(from, lf == std::string::npos ? std::string::npos : lf - from));
+        if (lf == std::string::npos) break;
+        from = lf + 1;
+    }
+    bool open = false;
+    size_t open_line = 0;
+    std::vector<std::string> lists[3];
+    auto complete = [&] { return !lists[2].empty() && (!lists[0].empty() || !lists[1].empty()); };
+    auto store = [&] {
+        Collected c;
+        for (int a = 0; a < 3; ++a) c.lists[a] = lists[a];
+        collect_record(&c);
+        r.records.push_back(c.records[0]);
+        for (auto &l : lists) l.clear();
+    };
+    auto fail = [&](int point, size_t line) {
+        r.status = 21;
+        r.point = point;
+        r.line = line;
+        return r;
+    };
+    const struct {
+        const char *kw;
+        int attr, outside, no_colon;
+    } attrs[] = {{"NAME", 0, 165, 166}, {"ADDRESS", 1, 167, 168}, {"CLUSTER", 2, 169, 170}};
+    for (size_t ln = 0; ln < lines.size(); ++ln) {
+        std::string rest = lines[ln];
+        for (;;) {
+            size_t b = 0;
+            while (b < rest.size() && space(rest[b])) ++b;
+            rest = rest.substr(b);
+            if (rest.empty() || rest[0] == '#') break;
+            if (starts_with_keyword(rest, "NODE")) {
+                if (open && !complete()) return fail(157, open_line);
+                if (open) store();
+                size_t colon = rest.find(':', 4);
+                if (colon == std::string::npos) return fail(164, ln + 1);
+                open = true;
+                open_line = ln + 1;
+                for (auto &l : lists) l.clear();
+                rest = rest.substr(colon + 1);
+                continue;
+            }
+            bool matched = false;
+            for (const auto &a : attrs) {
+                if (!starts_with_keyword(rest, a.kw)) continue;
+                matched = true;
+                if (!open || !lists[a.attr].empty()) return fail(a.outside, ln + 1);
+                size_t colon = rest.find(':', std::strlen(a.kw));
+                if (colon == std::string::npos) return fail(a.no_colon, ln + 1);
+                lists[a.attr] = values(rest.substr(colon + 1));
+                break;
+            }
+            if (!matched) return fail(171, ln + 1);
+            break;  // an attribute takes the rest of its line
+        }
+    }
+    if (open) {
+        if (!complete()) return fail(157, open_line);
+        store();
+    }
+    return r;
+}
+
+}  // namespace oracle
+
+TEST(ClusterText, AgreesWithAReferenceParserOnRandomTexts) {
+    static const std::vector<std::string> tokens = {
+        "NODE", "node", "Nodes", "NAME", "name", "NAMES", "ADDRESS", "address", "CLUSTER", "Cluster", ":", ":", ":",
+        " ", " ", "  ", "\t", "\n", "\n", "\n", "\r", "\r\n", "#", "a", "b1", "10.0.0.1", "x#y", std::string(1, '\0'),
+        "\xff", "=", "NAM", "CLUST", "\v", "\f"};
+    std::mt19937 rng(1234);
+    int valid = 0;
+    for (int round = 0; round < 30000; ++round) {
+        std::string text;
+        if (round % 3 == 0) text = "NODE:\n";
+        int n = static_cast<int>(rng() % 40);
+        for (int i = 0; i < n; ++i) text += tokens[rng() % tokens.size()];
+        Outcome o = parse(text);
+        oracle::Result want = oracle::parse(text);
+        if (o.result.status == 0) ++valid;
+        ASSERT_EQ(o.result.status, want.status) << testing::PrintToString(text);
+        ASSERT_EQ(o.result.point, want.point) << testing::PrintToString(text);
+        if (want.status != 0) {
+            ASSERT_EQ(o.result.line, want.line) << testing::PrintToString(text);
+        }
+        ASSERT_EQ(o.records, want.records) << testing::PrintToString(text);
+    }
+    EXPECT_GT(valid, 1000) << "the sweep reaches valid texts too";
+}
+
+TEST(ClusterText, HostileTextsEndQuickly) {
+    const struct {
+        const char *label;
+        std::string text;
+        int32_t status;
+    } cases[] = {
+        {"10 MB without an LF or a colon", std::string(10 << 20, 'N'), 21},
+        {"NODE: repeated on one line", [] {
+             std::string t;
+             for (int i = 0; i < 200000; ++i) t += "NODE:";
+             return t;
+         }(), 21},
+        {"a value list of a million blanks", "NODE:\nNAME:" + std::string(1 << 20, ' ') + "x\nCLUSTER: c\n", 0},
+        {"a million single-letter values", [] {
+             std::string t = "NODE:\nCLUSTER: c\nNAME:";
+             for (int i = 0; i < 1000000; ++i) t += " a";
+             return t;
+         }(), 0},
+        {"a 10 MB comment", "#" + std::string(10 << 20, 'x') + "\n", 0},
+        {"tabs between blanks", "NODE:\nCLUSTER: c\nNAME:" + [] {
+             std::string t;
+             for (int i = 0; i < 100000; ++i) t += " \t ";
+             return t;
+         }(), 21},
+    };
+    for (const auto &c : cases) {
+        SCOPED_TRACE(c.label);
+        Collected sink;
+        idm::clmap::ParseSink s{&sink, [](void *, Attr, std::string_view) -> int32_t { return 0; },
+                                [](void *) -> int32_t { return 0; }};
+        EXPECT_EQ(idm::clmap::parse(c.text, s).status, c.status);
+    }
+    std::mt19937 rng(99);
+    for (int round = 0; round < 20; ++round) {
+        std::string bytes(1 << 16, '\0');
+        for (char &b : bytes) b = static_cast<char>(rng());
+        Outcome o = parse(bytes);
+        EXPECT_TRUE(o.result.status == 0 || o.result.status == 21);
+    }
+}
