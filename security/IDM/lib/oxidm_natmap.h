@@ -55,7 +55,9 @@ int32_t idm__native_apply_rule(idm_rule *rule, idm_id *id, idm_buffer *result);
 // Sets `result` to the local name of a matched rule: the whole id token named
 // by the high half of the state word, or the mapping's own text with the
 // translator's `length`.  Empty for a rule without mapping.  Returns 0, or 6
-// with 2650-654 (result empty).  The caller frees result->value.
+// with 2650-654 (result empty); 38 with 2650-664 if the position lies past
+// the id's tokens, which idm__native_apply_rule never lets happen.  The
+// caller frees result->value.
 int32_t idm__native_get_mapping(idm_rule *rule, idm_id *id, idm_buffer *result);
 
 // Appends a byte copy of `rule` to the translator's rule cache (grown by 10
