@@ -7,7 +7,8 @@
 // stat, the comparison with lastmod, open, read and the working lists happen
 // with the read share; every change of the trees happens between a
 // promotion and a demotion, with thread cancellation disabled so that a
-// rebuild is never left half done.  Since promotion gives up the read share
+// rebuild is never left half done.  The old contents are detached there and
+// released after the demotion (OldTrees).  Since promotion gives up the read share
 // before it waits, another thread may reload in between; each reload
 // rebuilds both trees from scratch, so the last one wins.
 //
@@ -83,6 +84,43 @@ void clean_trees() {
     if (nametree.rst_node_cnt != 0) sec__rst_clean(&nametree);
     if (iptree.rst_node_cnt != 0) sec__rst_clean(&iptree);
 }
+
+// The trees' previous contents, taken out of nametree and iptree under the
+// write hold (which leaves both empty, exactly as a clean would) and
+// released through sec__rst_clean after the write hold has ended, when no
+// other thread can reach them any more.  Readers wait only for the rebuild,
+// and the old records are freed after the new ones were allocated: a clean
+// frees records in tree order, scattered over the heap, and new records
+// taken straight from those freed pieces would be scattered likewise,
+// making every later walk of the trees slower (a steady stream of 100,000-
+// host reloads ran more than twice as long that way).
+class OldTrees {
+  public:
+    OldTrees() = default;
+    ~OldTrees() { release(); }
+    OldTrees(const OldTrees &) = delete;
+    OldTrees &operator=(const OldTrees &) = delete;
+
+    // Caller holds the write hold.
+    void take() {
+        move(nametree, names_);
+        move(iptree, addresses_);
+    }
+    void release() {
+        if (names_.rst_node_cnt != 0) sec__rst_clean(&names_);
+        if (addresses_.rst_node_cnt != 0) sec__rst_clean(&addresses_);
+    }
+
+  private:
+    static void move(rst_tree &from, rst_tree &to) {
+        if (to.rst_node_cnt != 0) sec__rst_clean(&to);
+        to = from;
+        from.rst_root = nullptr;
+        from.rst_node_cnt = 0;
+    }
+    rst_tree names_{};
+    rst_tree addresses_{};
+};
 
 // Disables thread cancellation for the scope: a rebuild of the trees runs to
 // its end once it has begun.
@@ -467,10 +505,11 @@ class Builder {
 
 // Empties both trees under the write hold (file missing or empty).
 void empty_trees(MapHold &hold) {
+    OldTrees old;
     hold.promote();
     {
         NoCancel no_cancel;
-        clean_trees();
+        old.take();
     }
     hold.demote();
 }
@@ -555,12 +594,13 @@ int32_t idm__construct_clcfg(MapHold &hold, const char *text, size_t size) {
         const int64_t length = static_cast<int64_t>(size);
         trace::record_data(155, trace::ptr(text), trace::i64(length));
     }
+    idm::clmap::OldTrees old;
     idm::clmap::Builder builder(size);
     int32_t status = builder.allocate_lists();
     hold.promote();
     {
         idm::clmap::NoCancel no_cancel;
-        idm::clmap::clean_trees();
+        old.take();
         if (status == 0) {
             const idm::clmap::ParseSink sink = builder.sink();
             const idm::clmap::ParseResult r = idm::clmap::parse(std::string_view(text, size), sink);
