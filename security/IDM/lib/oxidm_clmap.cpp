@@ -7,10 +7,10 @@
 // stat, the comparison with lastmod, open, read and the working lists happen
 // with the read share; every change of the trees happens between a
 // promotion and a demotion, with thread cancellation disabled so that a
-// rebuild is never left half done.  The old contents are detached there and
-// released after the demotion (OldTrees).  Since promotion gives up the read share
-// before it waits, another thread may reload in between; each reload
-// rebuilds both trees from scratch, so the last one wins.
+// rebuild is never left half done; the old contents are detached there and
+// released after the demotion (OldTrees).  Since promotion gives up the
+// read share before it waits, another thread may reload in between; each
+// reload rebuilds both trees from scratch, so the last one wins.
 //
 // The file is read whole with one read() into a buffer of its size + 1, an
 // LF is appended, and parse() judges the text in place.  Values are copied
@@ -337,9 +337,8 @@ ParseResult parse(std::string_view text, const ParseSink &sink) {
     return {0, 0, text.size(), line};
 }
 
-// Every byte of the copy is written (the value, then its NUL), so it is
-// allocated with malloc: calloc bypasses the allocator's per-thread cache,
-// which costs a fifth of a large reload.
+// Every byte of the copy is written (the value, then its NUL), so there is
+// nothing for calloc to clear.
 char *copy_value(const char *begin, size_t length) {
     auto *copy = static_cast<char *>(xmalloc(length + 1));
     if (copy == nullptr) {
