@@ -123,28 +123,6 @@ TEST_F(Lock, ACancelledWaitingWriterReleasesTheReadersItHeldBack) {
     EXPECT_EQ(sec__trylock_write(&lock), 0);
 }
 
-TEST_F(Lock, ACancelledWriterBehindAnotherWriterWakesNoReader) {
-    sec__lock_write(&lock);
-    std::atomic<bool> reader_in{false};
-    Thread writer([&] { sec__lock_write(&lock); });
-    ASSERT_TRUE(blocked_on(writer.tid(), lock.writer_ok));
-    Thread reader([&] {
-        sec__lock_read(&lock);
-        reader_in = true;
-        sec__unlock_read(&lock);
-    });
-    ASSERT_TRUE(blocked_on(reader.tid(), lock.readers_ok));
-    writer.cancel();
-    EXPECT_TRUE(writer.join());
-    EXPECT_EQ(counts(), (Counts{-1, 0}));
-    EXPECT_TRUE(blocked_on(reader.tid(), lock.readers_ok)) << "a writer still holds the lock";
-    EXPECT_FALSE(reader_in.load());
-    sec__unlock_write(&lock);
-    ASSERT_TRUE(eventually(reader_in));
-    reader.join();
-    EXPECT_EQ(counts(), (Counts{0, 0}));
-}
-
 TEST_F(Lock, ACancelledWaitingReaderLeavesTheCountersAlone) {
     sec__lock_write(&lock);
     Thread reader([&] { sec__lock_read(&lock); });

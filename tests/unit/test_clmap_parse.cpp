@@ -16,7 +16,6 @@
 namespace {
 
 using idm::clmap::Attr;
-using idm::clmap::Keyword;
 using idm::clmap::ParseResult;
 
 // Collects the records as "N[a,b] A[x] C[c]" strings.
@@ -163,31 +162,6 @@ TEST(ClusterText, ASinkFailureStopsTheParseWithItsStatus) {
     EXPECT_EQ(o.result.status, 6);
     EXPECT_EQ(o.result.point, 0);
     EXPECT_TRUE(o.records.empty());
-}
-
-TEST(ClusterText, LongListsAndLongValues) {
-    std::string names, expected = "N[";
-    for (int i = 0; i < 1000; ++i) {
-        names += " n" + std::to_string(i);
-        expected += (i ? ",n" : "n") + std::to_string(i);
-    }
-    expected += "] C[" + std::string(100000, 'x') + "]";
-    Outcome o = parse("NODE:\nNAME:" + names + "\nCLUSTER: " + std::string(100000, 'x') + "\n");
-    ASSERT_EQ(o.result.status, 0);
-    EXPECT_EQ(o.records, std::vector<std::string>{expected});
-}
-
-TEST(ClusterText, KeywordOfComparesOnlyTheKeywordsLength) {
-    struct Case {
-        const char *statement;
-        Keyword keyword;
-    } cases[] = {
-        {"NODE", Keyword::kNode},       {"nodes:", Keyword::kNode},       {"NAMEhosta", Keyword::kName},
-        {"addresses", Keyword::kAddress}, {"Cluster:", Keyword::kCluster}, {"ADDRES", Keyword::kNone},
-        {"NAM", Keyword::kNone},         {"", Keyword::kNone},             {"#NODE", Keyword::kNone},
-        {"N\xC3\x96" "DE", Keyword::kNone},
-    };
-    for (const Case &c : cases) EXPECT_EQ(idm::clmap::keyword_of(c.statement), c.keyword) << c.statement;
 }
 
 TEST(ClusterText, ScanValueStopsAtTheFirstBlankOrTheLine) {
