@@ -75,6 +75,13 @@ bool blocked_on(pid_t tid, const T &object) {
     return false;
 }
 
+// Whether /proc shows the system call a thread sleeps in (blocked_on needs it).
+inline bool can_see_blocked_threads() {
+    std::ifstream f("/proc/self/syscall");
+    long nr = -1;
+    return static_cast<bool>(f >> nr);
+}
+
 // Spins (yielding) until `flag` is true; false after about 30 s.
 inline bool eventually(const std::atomic<bool> &flag) {
     for (int i = 0; i < 300000 && !flag.load(); ++i) usleep(100);
