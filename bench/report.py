@@ -1,65 +1,208 @@
 #!/usr/bin/env python3
-"""Prints the benchmark table: figure, baseline from the same run, ratio, target.
+"""Prints the benchmark table: each figure next to its limit or peer from the
+same run, the ratio and the target verdict.
 
-ratios.txt, one line per row (fields separated by '|'):
-    label | figure benchmark name | baseline benchmark name or - | target ratio or - | note
-A ratio target t means figure/baseline must be <= t (t > 0), or baseline/figure
-must be >= -t (t < 0, for "at least N times faster than" targets).
+Usage: report.py RESULTS_DIR ROWS_FILE [--markdown]
+
+RESULTS_DIR holds one Google Benchmark JSON file per family.  Every
+benchmark ran with repetitions; a figure is the median of its repetitions
+(wall time per iteration, or a counter's value).
+
+ROWS_FILE (bench/ratios.txt), one row per line, fields separated by '|':
+    label | figure | baseline | target | note
+  figure, baseline:  a benchmark name (its time per iteration),
+                     NAME@COUNTER (the median of that user counter),
+                     =25ns, =100ms (a fixed time budget) or =1e7 (a fixed value),
+                     or - (no baseline).
+                     A - B (a difference), N*A (a multiple).
+  target:            <=X   figure / baseline must be at most X
+                     >=X   figure / baseline must be at least X
+                     Xx    the figure must be at least X times faster
+                           (baseline / figure >= X)
+                     -     no target (context only)
+                     (a bare number X means <=X, a negative one -X means Xx:
+                     the older form.)
+Lines starting with '#' are comments; '## Title' starts a section.
 """
-import json, os, sys
+import json
+import os
+import re
+import statistics
+import sys
+
+UNITS = {'ns': 1.0, 'us': 1e3, 'ms': 1e6, 's': 1e9}
+SKIP = {'name', 'run_name', 'run_type', 'repetitions', 'repetition_index', 'threads', 'iterations',
+        'real_time', 'cpu_time', 'time_unit', 'family_index', 'per_family_instance_index',
+        'aggregate_name', 'aggregate_unit', 'label', 'error_occurred', 'error_message'}
+
 
 def load(folder):
-    times = {}
+    """name -> {'time': [ns...], 'counters': {k: [v...]}, 'error': text}"""
+    runs = {}
     for f in sorted(os.listdir(folder)):
         if not f.endswith('.json'):
             continue
-        data = json.load(open(os.path.join(folder, f)))
+        try:
+            data = json.load(open(os.path.join(folder, f)))
+        except ValueError:
+            continue
         for b in data.get('benchmarks', []):
             if b.get('run_type') == 'aggregate':
                 continue
-            unit = {'ns': 1.0, 'us': 1e3, 'ms': 1e6, 's': 1e9}[b.get('time_unit', 'ns')]
-            times[b['name']] = (b['real_time'] * unit, b)
-    return times
+            name = b.get('run_name', b['name'])
+            r = runs.setdefault(name, {'time': [], 'counters': {}, 'error': None})
+            if b.get('error_occurred'):
+                r['error'] = b.get('error_message', 'error')
+                continue
+            r['time'].append(b['real_time'] * UNITS[b.get('time_unit', 'ns')])
+            for k, v in b.items():
+                if k not in SKIP and isinstance(v, (int, float)):
+                    r['counters'].setdefault(k, []).append(float(v))
+    return runs
 
-def fmt(ns):
+
+def fmt_time(ns):
+    if ns >= 1e9: return '%.2f s' % (ns / 1e9)
     if ns >= 1e6: return '%.2f ms' % (ns / 1e6)
     if ns >= 1e3: return '%.2f us' % (ns / 1e3)
     return '%.1f ns' % ns
 
-def main():
-    times = load(sys.argv[1])
-    rows = []
-    for line in open(sys.argv[2]):
+
+def fmt_value(v):
+    for limit, suffix in ((1e9, 'G'), (1e6, 'M'), (1e3, 'k')):
+        if abs(v) >= limit:
+            return '%.3g%s' % (v / limit, suffix)
+    return '%.3g' % v
+
+
+def resolve(spec, runs):
+    """(value, is_time, shown text) or (None, ..., why).  A spec may also be
+    a difference "A - B" or carry a factor "3*A"."""
+    if ' - ' in spec:
+        parts = [resolve(x.strip(), runs) for x in spec.split(' - ')]
+        for v, _, why in parts:
+            if v is None:
+                return None, True, why
+        v = parts[0][0] - sum(p[0] for p in parts[1:])
+        return v, parts[0][1], fmt_time(v) if parts[0][1] else fmt_value(v)
+    m = re.fullmatch(r'([0-9.]+)\*(.+)', spec)
+    if m:
+        v, is_time, why = resolve(m.group(2), runs)
+        if v is None:
+            return v, is_time, why
+        v *= float(m.group(1))
+        return v, is_time, (fmt_time(v) if is_time else fmt_value(v)) + ' (%sx)' % m.group(1)
+    if spec in ('', '-'):
+        return None, True, ''
+    if spec.startswith('='):
+        m = re.fullmatch(r'=([0-9.eE+-]+)\s*(ns|us|ms|s)?', spec)
+        if not m:
+            return None, True, 'bad constant ' + spec
+        if m.group(2):
+            v = float(m.group(1)) * UNITS[m.group(2)]
+            return v, True, 'budget ' + fmt_time(v)
+        v = float(m.group(1))
+        return v, False, 'target ' + fmt_value(v)
+    name, _, counter = spec.partition('@')
+    r = runs.get(name)
+    if r is None:
+        return None, True, 'missing: ' + name
+    if r['error']:
+        return None, True, 'skipped: ' + r['error']
+    if counter:
+        vals = r['counters'].get(counter)
+        if not vals:
+            return None, False, 'no counter ' + spec
+        v = statistics.median(vals)
+        return v, False, fmt_value(v)
+    if not r['time']:
+        return None, True, 'no time: ' + name
+    v = statistics.median(r['time'])
+    return v, True, fmt_time(v)
+
+
+def parse_target(t):
+    t = t.strip()
+    if t in ('', '-'):
+        return None
+    m = re.fullmatch(r'(<=|>=)\s*([0-9.]+)', t)
+    if m:
+        return m.group(1), float(m.group(2))
+    m = re.fullmatch(r'([0-9.]+)\s*x', t)
+    if m:
+        return 'x', float(m.group(1))
+    v = float(t)
+    return ('x', -v) if v < 0 else ('<=', v)
+
+
+def rows(path, runs):
+    out = []
+    for line in open(path):
         line = line.strip()
-        if not line or line.startswith('#'):
+        if not line or (line.startswith('#') and not line.startswith('## ')):
             continue
-        label, fig, base, target, note = [x.strip() for x in (line.split('|') + ['', '', '', ''])[:5]]
-        if fig not in times:
-            rows.append((label, 'missing', '', '', '', note)); continue
-        f = times[fig][0]
-        if base in ('', '-') or base not in times:
-            rows.append((label, fmt(f), '', '', '', note)); continue
-        b = times[base][0]
-        ratio = f / b
-        verdict = ''
-        if target not in ('', '-'):
-            t = float(target)
-            ok = ratio <= t if t > 0 else (b / f) >= -t
-            verdict = ('ok' if ok else 'MISSED') + (' (<= %.2fx)' % t if t > 0 else ' (>= %gx faster)' % -t)
-        shown = '%.2fx' % ratio if ratio >= 0.01 else '1/%.0f' % (1 / ratio)
-        rows.append((label, fmt(f), fmt(b) + ' ' + base.split('/')[0], shown, verdict, note))
-    w = [max(len(r[i]) for r in rows + [('figure', 'time', 'baseline', 'ratio', 'target', '')]) for i in range(5)]
-    head = ('figure', 'time', 'baseline', 'ratio', 'target')
-    print('  '.join(h.ljust(w[i]) for i, h in enumerate(head)))
-    for r in rows:
-        print('  '.join(r[i].ljust(w[i]) for i in range(5)) + ('  ' + r[5] if r[5] else ''))
-    # Extra counters (lines/s, bytes, calls/s) are printed by the families themselves.
-    for name, (t, b) in sorted(times.items()):
-        counters = {k: v for k, v in b.items() if k not in ('name', 'run_name', 'run_type', 'repetitions',
-                    'repetition_index', 'threads', 'iterations', 'real_time', 'cpu_time', 'time_unit',
-                    'family_index', 'per_family_instance_index', 'aggregate_name', 'label', 'error_occurred',
-                    'error_message')}
-        if counters:
-            print('  %s: %s' % (name, ', '.join('%s=%.4g' % (k, v) for k, v in counters.items() if isinstance(v, (int, float)))))
+        if line.startswith('## '):
+            out.append(('section', line[3:].strip()))
+            continue
+        label, fig, base, target, note = [x.strip() for x in (line.split('|') + [''] * 4)[:5]]
+        fv, _, fshown = resolve(fig, runs)
+        bv, _, bshown = resolve(base, runs)
+        ratio = verdict = ''
+        goal = parse_target(target)
+        if fv is not None and bv is not None and fv > 0 and bv > 0:
+            r = fv / bv
+            if goal and goal[0] == 'x':
+                ratio = '%.1fx faster' % (bv / fv) if bv / fv >= 1 else '%.2fx slower' % (fv / bv)
+                ok = bv / fv >= goal[1]
+                verdict = ('ok' if ok else 'MISSED') + ' (>= %gx faster)' % goal[1]
+            else:
+                ratio = '%.2f' % r if r < 100 else '%.0f' % r
+                if goal:
+                    ok = r <= goal[1] if goal[0] == '<=' else r >= goal[1]
+                    verdict = ('ok' if ok else 'MISSED') + ' (%s %g)' % goal
+        elif fv is None and fshown:
+            fshown = fshown
+        out.append(('row', label, fshown, bshown, ratio, verdict, note))
+    return out
+
+
+def print_text(table):
+    head = ('figure', 'measured', 'limit or peer', 'ratio', 'target')
+    body = [r for r in table if r[0] == 'row']
+    w = [max([len(h)] + [len(r[i + 1]) for r in body]) for i, h in enumerate(head)]
+    line = '  '.join(h.ljust(w[i]) for i, h in enumerate(head))
+    print(line)
+    print('-' * len(line))
+    for r in table:
+        if r[0] == 'section':
+            print('\n[%s]' % r[1])
+            continue
+        print('  '.join(r[i + 1].ljust(w[i]) for i in range(5)) + ('  ' + r[6] if r[6] else ''))
+
+
+def print_markdown(table):
+    print('| figure | measured | limit or peer | ratio | target |')
+    print('|---|---|---|---|---|')
+    for r in table:
+        if r[0] == 'section':
+            print('| **%s** | | | | |' % r[1])
+            continue
+        print('| %s | %s | %s | %s | %s |' % tuple(x.replace('|', '/') for x in r[1:6]))
+
+
+def main():
+    args = [a for a in sys.argv[1:] if not a.startswith('--')]
+    if len(args) != 2:
+        sys.exit(__doc__)
+    runs = load(args[0])
+    table = rows(args[1], runs)
+    if '--markdown' in sys.argv:
+        print_markdown(table)
+    else:
+        print_text(table)
+    missed = sum(1 for r in table if r[0] == 'row' and r[5].startswith('MISSED'))
+    met = sum(1 for r in table if r[0] == 'row' and r[5].startswith('ok'))
+    print('\ntargets: %d met, %d missed' % (met, missed))
+
 
 main()

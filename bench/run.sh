@@ -1,23 +1,39 @@
 #!/bin/bash
-# Builds the release preset, runs every benchmark program (one process per
-# family) and prints one table: each figure next to its limit or peer from the
-# same run, with the ratio and the target.  Usage: bench/run.sh [filter-regex]
+# Builds the library and the benchmarks in release mode, runs every family
+# (one process each, with repetitions) and prints one table: each figure next
+# to its limit or peer measured in the same run, the ratio and the target.
+#
+# Usage: bench/run.sh [--markdown] [filter-regex]
+#   OXIDM_BENCH_BUILD   build directory (default build/release)
+#   OXIDM_BENCH_REPS    repetitions per benchmark (default 5; the table shows medians)
+#   OXIDM_BENCH_MIN_TIME  minimum time per repetition in seconds (default 0.1)
+# Runs as root: the families enter a private mount namespace so that the
+# library's fixed configuration paths are tmpfs mounts of their own.
 set -euo pipefail
 cd "$(dirname "$0")/.."
-missing=()
-for p in cmake ninja-build g++ libbenchmark-dev libgtest-dev python3; do
-  dpkg -s "$p" >/dev/null 2>&1 || missing+=("$p")
-done
-if ((${#missing[@]})); then apt-get install -y "${missing[@]}" >/dev/null; fi
-cmake --preset release >/dev/null
-cmake --build --preset release >/dev/null
-out=build/release/bench-results
-rm -rf "$out"; mkdir -p "$out"
-for exe in build/release/bench/bench_*; do
-  [[ -x $exe ]] || continue
+markdown=()
+if [[ ${1:-} == --markdown ]]; then markdown=(--markdown); shift; fi
+filter=${1:-.}
+build=${OXIDM_BENCH_BUILD:-build/release}
+reps=${OXIDM_BENCH_REPS:-5}
+min_time=${OXIDM_BENCH_MIN_TIME:-0.1}
+
+# Tools, Google Benchmark and nss_wrapper (scripts/deps.sh), and the peers
+# MIT Kerberos and the grid-mapfile lookup: benchmark-only dependencies.
+scripts/deps.sh libkrb5-dev libglobus-gss-assist-dev
+
+cmake --preset release -B "$build" -DOXIDM_TESTS=OFF >/dev/null
+cmake --build "$build" --target benchmarks >/dev/null
+
+out=$build/bench-results
+rm -rf "$out"
+mkdir -p "$out"
+for exe in "$build"/bench/bench_*; do
+  [[ -x $exe && ! -d $exe ]] || continue
   name=$(basename "$exe")
   echo "running $name" >&2
-  "$exe" --benchmark_filter="${1:-.}" --benchmark_min_time=0.2 \
-         --benchmark_out="$out/$name.json" --benchmark_out_format=json >/dev/null
+  "$exe" --benchmark_filter="$filter" --benchmark_repetitions="$reps" --benchmark_min_time="$min_time" \
+         --benchmark_out="$PWD/$out/$name.json" --benchmark_out_format=json >"$out/$name.txt" 2>&1 ||
+    echo "  $name failed; see $out/$name.txt" >&2
 done
-python3 bench/report.py "$out" bench/ratios.txt
+python3 bench/report.py "$out" bench/ratios.txt "${markdown[@]}"
