@@ -431,6 +431,7 @@ int32_t idm__parse_mapfile(const char *mechanism, const char *path, FILE *stream
     if (entries == nullptr) return leave(bad_param(23, kName, 47, 5, 0));
 
     if (trace::diag_on()) trace::record_data(42, trace::text(path), trace::text(mechanism));
+    const std::string_view selector(mechanism);
     int32_t status = 0;
     char piece[1024];
     while (std::fgets(piece, sizeof piece, stream) != nullptr) {
@@ -446,7 +447,9 @@ int32_t idm__parse_mapfile(const char *mechanism, const char *path, FILE *stream
             *hash = '\0';
             n = static_cast<size_t>(hash - piece);
         }
-        if (only_blanks(std::string_view(piece, n)) || idm__test_entry_mech(mechanism, piece) != 0) {
+        // The selector test of idm__test_entry_mech, on the length known here.
+        const std::string_view line(piece, n);
+        if (only_blanks(line) || !mapfile::selects(selector, line)) {
             if (trace::diag_on()) trace::record_id(45);
             continue;
         }
