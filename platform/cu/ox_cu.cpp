@@ -12,19 +12,60 @@
 #include <cstring>
 #include <mutex>
 #include <set>
+#include <unordered_map>
 #include <string>
 #include <vector>
 
+namespace {
+
+struct Conv {
+    int index;      // 1-based insert number
+    char type;      // 's', 'd', 'x', 'u'
+    size_t begin;   // position of '%'
+    size_t end;     // one past the conversion character
+};
+
+}  // namespace
+
+// One error.  The current error of a thread is formatted lazily: recording
+// keeps the inserts and a pointer to the default text (a catalogue's static
+// text), and the message is put together only when someone asks for it, so
+// that reporting stays cheap for callers that report on hot paths.
 struct cu_error {
     int status = 0;
     int reserved = 0;
     std::string catalog;
     int set = 0;
     int msgno = 0;
-    std::string deftext;
-    std::string text;
+    const char *deftext_ptr = "";
+    std::string deftext_copy;  // used by handles, which outlive the caller's text
+    bool owns_deftext = false;
+    std::vector<Conv> convs;
     std::vector<std::string> inserts;
     std::vector<unsigned long long> raw;
+    mutable std::string text;
+    mutable bool text_valid = false;
+
+    const char *deftext() const { return owns_deftext ? deftext_copy.c_str() : deftext_ptr; }
+    const std::string &formatted() const;
+    cu_error() = default;
+    cu_error(const cu_error &o) { *this = o; }
+    cu_error &operator=(const cu_error &o) {
+        if (this == &o) return *this;
+        status = o.status;
+        reserved = o.reserved;
+        catalog = o.catalog;
+        set = o.set;
+        msgno = o.msgno;
+        deftext_copy = o.deftext();
+        deftext_ptr = "";
+        owns_deftext = true;
+        convs = o.convs;
+        inserts = o.inserts;
+        raw = o.raw;
+        text_valid = false;
+        return *this;
+    }
 };
 
 namespace {
@@ -32,6 +73,9 @@ namespace {
 thread_local bool t_pending = false;
 thread_local cu_error t_error;
 thread_local unsigned long t_count = 0;
+// Parsed conversions per default text (texts are static catalogue entries).
+thread_local std::unordered_map<const char *, std::vector<Conv>> t_conv_cache;
+
 // Handles handed out by cu_get_error_1 stay reachable from here until
 // released: a caller that keeps one for the life of the process (trace
 // registration does) does not leak it.
@@ -44,16 +88,10 @@ std::string g_cluster_name;
 std::atomic<int> g_cluster_fail{0};
 std::atomic<int64_t> g_clock{0};
 
-struct Conv {
-    int index;      // 1-based insert number
-    char type;      // 's', 'd', 'x', 'u'
-    size_t begin;   // position of '%'
-    size_t end;     // one past the conversion character
-};
-
 // Finds the positional conversions "%N$s", "%N$d", "%N$x" (plain "%s"/"%d"
 // count in order of appearance).  "%%" is a literal percent sign.
-std::vector<Conv> conversions(const std::string &fmt) {
+std::vector<Conv> conversions(const char *text) {
+    std::string fmt(text);
     std::vector<Conv> out;
     int next = 1;
     for (size_t i = 0; i < fmt.size(); ++i) {
@@ -77,30 +115,53 @@ std::vector<Conv> conversions(const std::string &fmt) {
 
 }  // namespace
 
+const std::string &cu_error::formatted() const {
+    if (text_valid) return text;
+    std::string def = deftext();
+    std::string out;
+    size_t pos = 0;
+    for (const Conv &c : convs) {
+        out.append(def, pos, c.begin - pos);
+        if (c.index >= 1 && c.index <= static_cast<int>(inserts.size())) out += inserts[c.index - 1];
+        pos = c.end;
+    }
+    out.append(def, pos, std::string::npos);
+    // "%%" stands for one percent sign.
+    for (size_t i = 0; (i = out.find("%%", i)) != std::string::npos; ++i) out.erase(i, 1);
+    text = std::move(out);
+    text_valid = true;
+    return text;
+}
+
 extern "C" int cu_set_error_1(int status, int reserved, const char *catalog, int set, int msgno,
                               const char *deftext, ...) {
-    cu_error e;
+    cu_error &e = t_error;
     e.status = status;
     e.reserved = reserved;
     e.catalog = catalog ? catalog : "";
     e.set = set;
     e.msgno = msgno;
-    e.deftext = deftext ? deftext : "";
-    std::vector<Conv> convs = conversions(e.deftext);
+    e.deftext_ptr = deftext ? deftext : "";
+    e.owns_deftext = false;
+    e.text_valid = false;
+    auto it = t_conv_cache.find(e.deftext_ptr);
+    if (it == t_conv_cache.end()) it = t_conv_cache.emplace(e.deftext_ptr, conversions(e.deftext_ptr)).first;
+    e.convs = it->second;
     int n = 0;
-    for (const Conv &c : convs) n = std::max(n, c.index);
-    std::vector<char> types(n + 1, 'd');
-    for (const Conv &c : convs) types[c.index] = c.type;
+    for (const Conv &c : e.convs) n = std::max(n, c.index);
+    char types[16] = {};
+    for (const Conv &c : e.convs)
+        if (c.index < 16) types[c.index] = c.type;
     e.inserts.resize(n);
-    e.raw.resize(n);
+    e.raw.assign(n, 0);
     va_list ap;
     va_start(ap, deftext);
     for (int i = 1; i <= n; ++i) {
-        char buf[64];
-        switch (types[i]) {
+        char buf[32];
+        switch (i < 16 ? types[i] : 'd') {
         case 's': {
             const char *s = va_arg(ap, const char *);
-            e.inserts[i - 1] = s ? s : "(null)";
+            e.inserts[i - 1].assign(s ? s : "(null)");
             break;
         }
         case 'x': {
@@ -108,38 +169,26 @@ extern "C" int cu_set_error_1(int status, int reserved, const char *catalog, int
             unsigned long long v = va_arg(ap, unsigned long long);
             e.raw[i - 1] = v;
             std::snprintf(buf, sizeof buf, "%x", static_cast<unsigned>(v));
-            e.inserts[i - 1] = buf;
+            e.inserts[i - 1].assign(buf);
             break;
         }
         case 'u': {
             unsigned v = va_arg(ap, unsigned);
             e.raw[i - 1] = v;
             std::snprintf(buf, sizeof buf, "%u", v);
-            e.inserts[i - 1] = buf;
+            e.inserts[i - 1].assign(buf);
             break;
         }
         default: {
             int v = va_arg(ap, int);
             e.raw[i - 1] = static_cast<unsigned long long>(static_cast<long long>(v));
             std::snprintf(buf, sizeof buf, "%d", v);
-            e.inserts[i - 1] = buf;
+            e.inserts[i - 1].assign(buf);
             break;
         }
         }
     }
     va_end(ap);
-    std::string text;
-    size_t pos = 0;
-    for (const Conv &c : convs) {
-        text.append(e.deftext, pos, c.begin - pos);
-        text += e.inserts[c.index - 1];
-        pos = c.end;
-    }
-    text.append(e.deftext, pos, std::string::npos);
-    // "%%" stands for one percent sign.
-    for (size_t i = 0; (i = text.find("%%", i)) != std::string::npos; ++i) text.erase(i, 1);
-    e.text = std::move(text);
-    t_error = std::move(e);
     t_pending = true;
     ++t_count;
     return status;
@@ -235,8 +284,8 @@ extern "C" int cux_error_reserved(void) { return t_error.reserved; }
 extern "C" const char *cux_error_catalog(void) { return t_error.catalog.c_str(); }
 extern "C" int cux_error_set(void) { return t_error.set; }
 extern "C" int cux_error_msgno(void) { return t_pending ? t_error.msgno : 0; }
-extern "C" const char *cux_error_deftext(void) { return t_error.deftext.c_str(); }
-extern "C" const char *cux_error_text(void) { return t_error.text.c_str(); }
+extern "C" const char *cux_error_deftext(void) { return t_error.deftext(); }
+extern "C" const char *cux_error_text(void) { return t_error.formatted().c_str(); }
 extern "C" int cux_error_insert_count(void) { return static_cast<int>(t_error.inserts.size()); }
 extern "C" const char *cux_error_insert(int i) {
     if (i < 1 || i > static_cast<int>(t_error.inserts.size())) return nullptr;
