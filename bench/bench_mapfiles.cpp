@@ -179,7 +179,9 @@ int main(int argc, char **argv) {
         std::fprintf(stderr, "bench_mapfiles: needs a private mount namespace (run as root)\n");
         return 1;
     }
-    benchmark::RegisterBenchmark("BM_mapfiles_pass_memory", BM_mapfiles_pass_memory)->Iterations(3)->Unit(benchmark::kMillisecond);
+    benchmark::RegisterBenchmark("BM_mapfiles_pass_memory", BM_mapfiles_pass_memory)
+        ->Iterations(3)
+        ->Unit(benchmark::kMillisecond);
     for (int present : {1, 0}) {
         benchmark::RegisterBenchmark("BM_mapfiles_test_unchanged", BM_mapfiles_test_unchanged)->Arg(present);
         benchmark::RegisterBenchmark("BM_mapfiles_stat3", BM_mapfiles_stat3)->Arg(present);

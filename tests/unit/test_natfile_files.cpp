@@ -64,7 +64,9 @@ struct Pass {
         idm__native_release_entry_list(count, entries);
         idm__native_release_cachef(set);
     }
-    int32_t read(const char *mechanism = "mechA") { return idm__native_read_mapfiles(mechanism, &set, &count, &entries); }
+    int32_t read(const char *mechanism = "mechA") {
+        return idm__native_read_mapfiles(mechanism, &set, &count, &entries);
+    }
     std::vector<std::string> shown() const {
         std::vector<std::string> out;
         for (int32_t i = 0; i < count; ++i)
@@ -268,7 +270,8 @@ TEST_F(MapFiles, OpenFailures) {
         {"other open failure", 23, 0, kLocalMap, 23, idm::kMsg655, {"idm__open_mapfile", "23", "idm__ready_mapfile"}},
         {"unknown open result", 99, 0, kLocalMap, 23, idm::kMsg655, {"idm__open_mapfile", "99", "idm__ready_mapfile"}},
         {"lock not had in time", 0, 30, kLocalMap, 30, idm::kMsg656, {"idm__readlock_mapfile", path}},
-        {"other lock failure", 0, 23, kLocalMap, 23, idm::kMsg655, {"idm__readlock_mapfile", "23", "idm__ready_mapfile"}},
+        {"other lock failure", 0, 23, kLocalMap, 23, idm::kMsg655,
+         {"idm__readlock_mapfile", "23", "idm__ready_mapfile"}},
     };
     const int descriptors = open_descriptors();
     for (const auto &c : cases) {

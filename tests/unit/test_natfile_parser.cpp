@@ -358,7 +358,8 @@ TEST_F(Parser, LongLineIsSplitAfter1023Characters) {
         {"rest skipped", "mechA", "mechA:net=" + std::string(1013, 'L') + "ABCDEFG",
          {"net=" + std::string(1013, 'L')}},
         // Here the 7 characters are a valid line themselves.
-        {"rest is a line", "m", "m:net=" + std::string(1017, 'L') + "m:ab=cd", {"net=" + std::string(1017, 'L'), "ab=cd"}},
+        {"rest is a line", "m", "m:net=" + std::string(1017, 'L') + "m:ab=cd",
+         {"net=" + std::string(1017, 'L'), "ab=cd"}},
         // Exactly 1023 characters and its line feed: one line.
         {"1023 characters", "mechA", "mechA:net=" + std::string(1013, 'L'), {"net=" + std::string(1013, 'L')}},
     };

@@ -365,7 +365,9 @@ int32_t idm__ready_mapfile(const char *path, int32_t *fd, FILE **stream) {
     trace::Api api(kIds, trace::text(path, "[null]"), trace::ptr(fd), trace::ptr(stream));
     int32_t d = -1;
     FILE *s = nullptr;
-    auto leave = [&](int32_t status) { return api.leave(status, trace::text(path, "[null]"), trace::i32(d), trace::ptr(s)); };
+    auto leave = [&](int32_t status) {
+        return api.leave(status, trace::text(path, "[null]"), trace::i32(d), trace::ptr(s));
+    };
     auto bad = [&](int32_t position, uintptr_t value) {
         if (trace::error_on()) trace::record_data(35, trace::i32(position));
         return leave(report_bad_internal_param(23, kName, position, hex(value)));
@@ -456,6 +458,7 @@ int32_t idm__parse_mapfile(const char *mechanism, const char *path, FILE *stream
         status = idm__read_mapfile_entries(piece, count, entries);
         if (status != 0) break;
     }
+    explicit_bzero(piece, sizeof piece);  // the last line read
     if (trace::diag_on()) trace::record_id(46);
     return leave(status);
 }
