@@ -12,6 +12,7 @@
 #include <benchmark/benchmark.h>
 #include <fcntl.h>
 #include <pthread.h>
+#include <sys/mman.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -71,6 +72,33 @@ inline void mutex_pair(benchmark::State &state) {
         benchmark::ClobberMemory();
         pthread_mutex_unlock(&m);
     }
+}
+
+// The first write to one 4 KiB page of fresh anonymous memory: the page
+// fault and the zeroing of the page.  Whatever a load builds in memory the
+// process has not used before costs this much per page on top of the work.
+inline void page_first_touch(benchmark::State &state) {
+    constexpr size_t kPage = 4096;
+    constexpr size_t kRegion = size_t{64} << 20;
+    char *region = nullptr;
+    size_t used = kRegion;
+    for (auto _ : state) {
+        if (used == kRegion) {
+            state.PauseTiming();
+            if (region != nullptr) munmap(region, kRegion);
+            region = static_cast<char *>(mmap(nullptr, kRegion, PROT_READ | PROT_WRITE, MAP_PRIVATE | MAP_ANONYMOUS, -1, 0));
+            if (region == MAP_FAILED) {
+                state.SkipWithError("mmap failed");
+                return;
+            }
+            used = 0;
+            state.ResumeTiming();
+        }
+        region[used] = 1;
+        benchmark::ClobberMemory();
+        used += kPage;
+    }
+    if (region != nullptr) munmap(region, kRegion);
 }
 
 }  // namespace bench

@@ -5,6 +5,8 @@
 //     stat() calls an unchanged request makes (the local map file present,
 //     both global files absent, as here);
 //   - one uncontended mutex lock and unlock;
+//   - the first write to a page of fresh memory (what every byte a load
+//     builds costs on top of the work, until the process reuses its heap);
 //   - sec_idm_map_identity with unchanged files, the match at entry 1, 100
 //     and 10,000 of the mechanism's lines, for the plug-ins host and princ;
 //   - calls per second from 1, 2, 4 and 8 threads mapping at once, all for
@@ -83,6 +85,7 @@ void BM_limit_stat_absent(benchmark::State &state) {
     bench::stat_paths(state, kPaths);
 }
 void BM_limit_mutex_pair(benchmark::State &state) { bench::mutex_pair(state); }
+void BM_limit_page_first_touch(benchmark::State &state) { bench::page_first_touch(state); }
 
 // ---- one thread ----
 
@@ -173,6 +176,7 @@ int main(int argc, char **argv) {
     benchmark::RegisterBenchmark("BM_limit_stat_absent", BM_limit_stat_absent);
     benchmark::RegisterBenchmark("BM_limit_stat3", BM_limit_stat3);
     benchmark::RegisterBenchmark("BM_limit_mutex_pair", BM_limit_mutex_pair);
+    benchmark::RegisterBenchmark("BM_limit_page_first_touch", BM_limit_page_first_touch);
     for (int entry : {1, 100, kLines}) {
         benchmark::RegisterBenchmark("BM_map_host", BM_map_host)->Arg(entry)->ArgName("entry");
         benchmark::RegisterBenchmark("BM_map_princ", BM_map_princ)->Arg(entry)->ArgName("entry");

@@ -18,7 +18,8 @@ ROWS_FILE (bench/ratios.txt), one row per line, fields separated by '|':
   target:            <=X   figure / baseline must be at most X
                      >=X   figure / baseline must be at least X
                      Xx    the figure must be at least X times faster
-                           (baseline / figure >= X)
+                           (baseline / figure >= X); a bare x only shows
+                           the ratio that way
                      -     no target (context only)
                      (a bare number X means <=X, a negative one -X means Xx:
                      the older form.)
@@ -128,9 +129,9 @@ def parse_target(t):
     m = re.fullmatch(r'(<=|>=)\s*([0-9.]+)', t)
     if m:
         return m.group(1), float(m.group(2))
-    m = re.fullmatch(r'([0-9.]+)\s*x', t)
+    m = re.fullmatch(r'([0-9.]*)\s*x', t)
     if m:
-        return 'x', float(m.group(1))
+        return 'x', float(m.group(1)) if m.group(1) else None
     v = float(t)
     return ('x', -v) if v < 0 else ('<=', v)
 
@@ -153,8 +154,9 @@ def rows(path, runs):
             r = fv / bv
             if goal and goal[0] == 'x':
                 ratio = '%.1fx faster' % (bv / fv) if bv / fv >= 1 else '%.2fx slower' % (fv / bv)
-                ok = bv / fv >= goal[1]
-                verdict = ('ok' if ok else 'MISSED') + ' (>= %gx faster)' % goal[1]
+                if goal[1] is not None:
+                    ok = bv / fv >= goal[1]
+                    verdict = ('ok' if ok else 'MISSED') + ' (>= %gx faster)' % goal[1]
             else:
                 ratio = '%.2f' % r if r < 100 else '%.0f' % r
                 if goal:
