@@ -737,7 +737,9 @@ TEST_F(MapFiles, AllocationFailuresDuringAPass) {
         EXPECT_EQ(pass.count, 0);
         EXPECT_EQ(pass.entries, nullptr);
         EXPECT_EQ(mssx_locks_held(), 0);
-        if (n == 1) EXPECT_EQ(pass.set, nullptr);
+        if (n == 1) {
+            EXPECT_EQ(pass.set, nullptr);
+        }
         ASSERT_LT(n, 100);
     }
 }
