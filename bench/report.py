@@ -5,8 +5,10 @@ same run, the ratio and the target verdict.
 Usage: report.py RESULTS_DIR ROWS_FILE [--markdown]
 
 RESULTS_DIR holds one Google Benchmark JSON file per family.  Every
-benchmark ran with repetitions; a figure is the median of its repetitions
-(wall time per iteration, or a counter's value).
+benchmark ran with repetitions; a figure is the median of its repetitions:
+CPU time per iteration (single-threaded benchmarks: user + system time of
+the calling thread, robust against other load on a shared machine), the
+family's own measured time for manual-time benchmarks, or a counter's value.
 
 ROWS_FILE (bench/ratios.txt), one row per line, fields separated by '|':
     label | figure | baseline | target | note
@@ -14,7 +16,7 @@ ROWS_FILE (bench/ratios.txt), one row per line, fields separated by '|':
                      NAME@COUNTER (the median of that user counter),
                      =25ns, =100ms (a fixed time budget) or =1e7 (a fixed value),
                      or - (no baseline).
-                     A - B (a difference), N*A (a multiple).
+                     A - B (a difference), N*A (a multiple), N*(A - B).
   target:            <=X   figure / baseline must be at most X
                      >=X   figure / baseline must be at least X
                      Xx    the figure must be at least X times faster
@@ -55,7 +57,13 @@ def load(folder):
             if b.get('error_occurred'):
                 r['error'] = b.get('error_message', 'error')
                 continue
-            r['time'].append(b['real_time'] * UNITS[b.get('time_unit', 'ns')])
+            # CPU time of the process for ordinary benchmarks (they run on one
+            # thread, so this is that thread's user and system time, which
+            # other load on the machine does not inflate); the measured time
+            # for manual-time ones (wall time of thread batches, or a
+            # difference a family computed itself).
+            t = b['real_time'] if 'manual_time' in name else b['cpu_time']
+            r['time'].append(t * UNITS[b.get('time_unit', 'ns')])
             for k, v in b.items():
                 if k not in SKIP and isinstance(v, (int, float)):
                     r['counters'].setdefault(k, []).append(float(v))
@@ -79,6 +87,13 @@ def fmt_value(v):
 def resolve(spec, runs):
     """(value, is_time, shown text) or (None, ..., why).  A spec may also be
     a difference "A - B" or carry a factor "3*A"."""
+    m = re.fullmatch(r'([0-9.eE+-]+)\*\((.+)\)', spec)
+    if m:
+        v, is_time, why = resolve(m.group(2), runs)
+        if v is None:
+            return v, is_time, why
+        v *= float(m.group(1))
+        return v, is_time, fmt_time(v) if is_time else fmt_value(v)
     if ' - ' in spec:
         parts = [resolve(x.strip(), runs) for x in spec.split(' - ')]
         for v, _, why in parts:
