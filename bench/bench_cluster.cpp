@@ -161,12 +161,6 @@ void BM_cluster_reload_100k(benchmark::State &state) {
 }
 BENCHMARK(BM_cluster_reload_100k)->Unit(benchmark::kMillisecond);
 
-// The reload's limit as a figure of its own (150 ms), for the ratio table.
-void BM_cluster_reload_limit(benchmark::State &state) {
-    for (auto _ : state) state.SetIterationTime(0.150);
-}
-BENCHMARK(BM_cluster_reload_limit)->UseManualTime()->Iterations(1)->Unit(benchmark::kMillisecond);
-
 // ---- the tree next to std::set<std::string> ----
 
 int compare_keys(const void *a, const void *b) {
