@@ -7,6 +7,8 @@
 // and while a reload waits for the write hold.
 #include <atomic>
 #include <memory>
+#include <mutex>
+#include <set>
 #include <string>
 #include <vector>
 
@@ -85,6 +87,8 @@ TEST_F(ClusterMap, EveryAnswerComesFromOneCompleteVersion) {
     cux_set_active_cluster("m3");
     std::atomic<bool> done{false};
     std::atomic<long> queries{0}, bad{0}, found{0};
+    std::mutex seen_mutex;
+    std::set<int> seen;  // versions answered from, over all threads
     std::vector<std::unique_ptr<Thread>> threads;
     for (int t = 0; t < kQueryThreads; ++t)
         threads.push_back(std::make_unique<Thread>([&, t] {
@@ -107,6 +111,10 @@ TEST_F(ClusterMap, EveryAnswerComesFromOneCompleteVersion) {
                 }
                 if (status == 0) {
                     found++;
+                    if (queries % 16 == 0) {
+                        std::lock_guard<std::mutex> g(seen_mutex);
+                        seen.insert(version);
+                    }
                     if (version < 0 || count != 2 || std::string(clusters[0]) != "v" + std::to_string(version)) bad++;
                 } else if (status == 1) {
                     if (version != -1) bad++;  // every valid version lists every host
@@ -120,6 +128,7 @@ TEST_F(ClusterMap, EveryAnswerComesFromOneCompleteVersion) {
     for (auto &t : threads) t->join();
     EXPECT_EQ(bad.load(), 0) << "of " << queries.load() << " queries";
     EXPECT_GT(found.load(), 0);
+    EXPECT_GT(seen.size(), 10u) << "the queries ran alongside the rewrites";
     oxtest::write_file(kNodeInfo, version_text(kVersions), 1000 + kVersions);
     idm::clmap::MapHold hold(&idmutex);
     char **clusters = nullptr;
