@@ -4,7 +4,9 @@
 //
 // State (all process-wide, set up by sec__idm_clmap_init, never torn down):
 //   nametree, iptree  guarded by idmutex; read under a read share, changed
-//                     only between a promotion and a demotion of idmutex
+//                     only between a promotion and a demotion of idmutex (a
+//                     reload detaches the old contents there and frees them
+//                     after the demotion, when no other thread can see them)
 //   lastmod           the file's modification time (whole seconds) at the
 //                     last load attempt; read and written whole (atomically)
 //                     by threads that hold only a read share
