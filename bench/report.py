@@ -5,10 +5,14 @@ same run, the ratio and the target verdict.
 Usage: report.py RESULTS_DIR ROWS_FILE [--markdown]
 
 RESULTS_DIR holds one Google Benchmark JSON file per family.  Every
-benchmark ran with repetitions; a figure is the median of its repetitions:
-CPU time per iteration (single-threaded benchmarks: user + system time of
-the calling thread, robust against other load on a shared machine), the
-family's own measured time for manual-time benchmarks, or a counter's value.
+benchmark ran with repetitions, randomly interleaved with the other
+benchmarks of its family, so that a figure and its limit sample the same
+moments.  A figure is taken from the least disturbed repetition (the one
+with the least time; noise on a shared machine only adds time): CPU time per
+iteration for ordinary benchmarks (they run on one thread: its user and
+system time), the family's own measured time for manual-time benchmarks, or
+a counter of that repetition.  The table's last column but one shows the
+spread (median over minimum of the repetitions) of the figure.
 
 ROWS_FILE (bench/ratios.txt), one row per line, fields separated by '|':
     label | figure | baseline | target | note
@@ -40,7 +44,7 @@ SKIP = {'name', 'run_name', 'run_type', 'repetitions', 'repetition_index', 'thre
 
 
 def load(folder):
-    """name -> {'time': [ns...], 'counters': {k: [v...]}, 'error': text}"""
+    """name -> {'reps': [(ns, {counter: value})...], 'error': text}"""
     runs = {}
     for f in sorted(os.listdir(folder)):
         if not f.endswith('.json'):
@@ -53,7 +57,7 @@ def load(folder):
             if b.get('run_type') == 'aggregate':
                 continue
             name = b.get('run_name', b['name'])
-            r = runs.setdefault(name, {'time': [], 'counters': {}, 'error': None})
+            r = runs.setdefault(name, {'reps': [], 'error': None})
             if b.get('error_occurred'):
                 r['error'] = b.get('error_message', 'error')
                 continue
@@ -63,11 +67,20 @@ def load(folder):
             # for manual-time ones (wall time of thread batches, or a
             # difference a family computed itself).
             t = b['real_time'] if 'manual_time' in name else b['cpu_time']
-            r['time'].append(t * UNITS[b.get('time_unit', 'ns')])
-            for k, v in b.items():
-                if k not in SKIP and isinstance(v, (int, float)):
-                    r['counters'].setdefault(k, []).append(float(v))
+            counters = {k: float(v) for k, v in b.items() if k not in SKIP and isinstance(v, (int, float))}
+            r['reps'].append((t * UNITS[b.get('time_unit', 'ns')], counters))
     return runs
+
+
+def best(r):
+    """The least disturbed repetition: the one with the least time."""
+    return min(r['reps'], key=lambda rep: rep[0])
+
+
+def spread(r):
+    """Median over minimum of the repetitions' times: how noisy the figure was."""
+    times = [rep[0] for rep in r['reps']]
+    return statistics.median(times) / min(times) if times and min(times) > 0 else 1.0
 
 
 def fmt_time(ns):
@@ -125,16 +138,15 @@ def resolve(spec, runs):
         return None, True, 'missing: ' + name
     if r['error']:
         return None, True, 'skipped: ' + r['error']
+    if not r['reps']:
+        return None, True, 'no result: ' + name
+    t, counters = best(r)
     if counter:
-        vals = r['counters'].get(counter)
-        if not vals:
+        if counter not in counters:
             return None, False, 'no counter ' + spec
-        v = statistics.median(vals)
+        v = counters[counter]
         return v, False, fmt_value(v)
-    if not r['time']:
-        return None, True, 'no time: ' + name
-    v = statistics.median(r['time'])
-    return v, True, fmt_time(v)
+    return t, True, fmt_time(t)
 
 
 def parse_target(t):
@@ -179,32 +191,38 @@ def rows(path, runs):
                     verdict = ('ok' if ok else 'MISSED') + ' (%s %g)' % goal
         elif fv is None and fshown:
             fshown = fshown
-        out.append(('row', label, fshown, bshown, ratio, verdict, note))
+        noise = ''
+        plain = fig.partition('@')[0]
+        if plain in runs and runs[plain]['reps'] and len(runs[plain]['reps']) > 1:
+            noise = '%.2f' % spread(runs[plain])
+        out.append(('row', label, fshown, bshown, ratio, verdict, noise, note))
     return out
 
 
+HEAD = ('figure', 'measured', 'limit or peer', 'ratio', 'target', 'spread')
+
+
 def print_text(table):
-    head = ('figure', 'measured', 'limit or peer', 'ratio', 'target')
     body = [r for r in table if r[0] == 'row']
-    w = [max([len(h)] + [len(r[i + 1]) for r in body]) for i, h in enumerate(head)]
-    line = '  '.join(h.ljust(w[i]) for i, h in enumerate(head))
+    w = [max([len(h)] + [len(r[i + 1]) for r in body]) for i, h in enumerate(HEAD)]
+    line = '  '.join(h.ljust(w[i]) for i, h in enumerate(HEAD))
     print(line)
     print('-' * len(line))
     for r in table:
         if r[0] == 'section':
             print('\n[%s]' % r[1])
             continue
-        print('  '.join(r[i + 1].ljust(w[i]) for i in range(5)) + ('  ' + r[6] if r[6] else ''))
+        print('  '.join(r[i + 1].ljust(w[i]) for i in range(len(HEAD))) + ('  ' + r[7] if r[7] else ''))
 
 
 def print_markdown(table):
-    print('| figure | measured | limit or peer | ratio | target |')
-    print('|---|---|---|---|---|')
+    print('| ' + ' | '.join(HEAD) + ' |')
+    print('|' + '---|' * len(HEAD))
     for r in table:
         if r[0] == 'section':
-            print('| **%s** | | | | |' % r[1])
+            print('| **%s** |' % r[1] + ' |' * (len(HEAD) - 1))
             continue
-        print('| %s | %s | %s | %s | %s |' % tuple(x.replace('|', '/') for x in r[1:6]))
+        print('| ' + ' | '.join(x.replace('|', '/') for x in r[1:1 + len(HEAD)]) + ' |')
 
 
 def main():

@@ -5,7 +5,8 @@
 #
 # Usage: bench/run.sh [--markdown] [filter-regex]
 #   OXIDM_BENCH_BUILD   build directory (default build/release)
-#   OXIDM_BENCH_REPS    repetitions per benchmark (default 5; the table shows medians)
+#   OXIDM_BENCH_REPS    repetitions per benchmark (default 7), randomly interleaved
+#                       within a family; the table takes the least disturbed one
 #   OXIDM_BENCH_MIN_TIME  minimum time per repetition in seconds (default 0.1)
 # Runs as root: the families enter a private mount namespace so that the
 # library's fixed configuration paths are tmpfs mounts of their own.
@@ -15,7 +16,7 @@ markdown=()
 if [[ ${1:-} == --markdown ]]; then markdown=(--markdown); shift; fi
 filter=${1:-.}
 build=${OXIDM_BENCH_BUILD:-build/release}
-reps=${OXIDM_BENCH_REPS:-5}
+reps=${OXIDM_BENCH_REPS:-7}
 min_time=${OXIDM_BENCH_MIN_TIME:-0.1}
 
 # Tools, Google Benchmark and nss_wrapper (scripts/deps.sh), and the peers
@@ -33,6 +34,7 @@ for exe in "$build"/bench/bench_*; do
   name=$(basename "$exe")
   echo "running $name" >&2
   "$exe" --benchmark_filter="$filter" --benchmark_repetitions="$reps" --benchmark_min_time="$min_time" \
+         --benchmark_enable_random_interleaving=true \
          --benchmark_out="$PWD/$out/$name.json" --benchmark_out_format=json >"$out/$name.txt" 2>&1 ||
     echo "  $name failed; see $out/$name.txt" >&2
 done
