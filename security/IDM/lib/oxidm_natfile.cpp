@@ -123,15 +123,22 @@ class MapfileHold {
     ~MapfileHold() {
         if (armed_) idm__thread_cleanup_mapfile(&file_);
         explicit_bzero(file_.path, sizeof file_.path);
+        explicit_bzero(buffer_, sizeof buffer_);
     }
     idm_open_mapfile &file() { return file_; }
     void disarm() { armed_ = false; }
+    // Makes the just opened stream read through this hold's buffer, which
+    // is zeroed when the hold ends (after the stream is closed): the stdio
+    // buffer that stdio would allocate holds the file's identities and is
+    // freed by fclose without being cleared.
+    void buffer_stream() { setvbuf(file_.stream, buffer_, _IOFBF, sizeof buffer_); }
     MapfileHold(const MapfileHold &) = delete;
     MapfileHold &operator=(const MapfileHold &) = delete;
 
   private:
     idm_open_mapfile file_;
     bool armed_ = true;
+    char buffer_[4096];
 };
 
 // The descriptor inside idm__ready_mapfile until it is handed to the caller:
@@ -793,6 +800,7 @@ int32_t idm__native_read_mapfiles(const char *mechanism, idm_mapfile_set **set, 
         idm_open_mapfile &open = hold.file();
         int32_t status = idm__ready_mapfile(open.path, &open.fd, &open.stream);
         if (status == 0) {
+            hold.buffer_stream();
             if (trace::diag_on()) trace::record_data(9, trace::text(open.path));
             status = idm__parse_mapfile(mechanism, open.path, open.stream, &list.count, &list.entries);
             sec__unlock_file(open.fd, kName);
