@@ -4,7 +4,8 @@
 // read), and cluster query threads while the node information file is
 // rewritten and a writer takes the lock now and then (so it lands while a
 // query waits as a reader, promotes, demotes, or reads the file; and writers
-// are cancelled while they wait too).  After each batch every lock is free,
+// are cancelled while they wait too); and a query cancelled in its
+// demotion behind a writer.  After each batch every lock is free,
 // no file lock or descriptor is left, nothing leaked, and the next calls
 // give the right answers.
 #include <pthread.h>
@@ -345,6 +346,65 @@ TEST_F(CancelRandom, ClusterQueriesAndWritersWhileTheFileChanges) {
     EXPECT_EQ(std::atoi(clusters[0] + 1), v);
     EXPECT_EQ(nametree.rst_node_cnt, 10u);
     EXPECT_EQ(iptree.rst_node_cnt, 10u);
+    EXPECT_TRUE(sweep::no_leaks());
+}
+
+// A query whose reload is done and which waits, in its demotion, behind a
+// writer: cancelled there it holds nothing, the writer goes on, and the
+// trees it built stay.  Which of the promoting query and the writer the
+// last reader's signal wakes is up to the condition variable, so the
+// scenario is repeated until the query was the one (almost always at once).
+TEST_F(CancelRandom, AQueryCancelledWhileItDemotesBehindAWriter) {
+    pthread_once(&idm__init_once_block, idm__state_init);
+    oxtest::write_file(oxtest::kNodeInfo, node_text(0), 1000);
+    ASSERT_EQ(sec_is_in_any_cluster("h1"), 1);
+    const auto settle = [](pid_t tid) {
+        for (int i = 0; i < 300000; ++i) {
+            if (int kind = blocked_kind(tid)) return kind;
+            usleep(100);
+        }
+        return 0;
+    };
+    bool done = false;
+    for (int attempt = 1; attempt <= 20 && !done; ++attempt) {
+        oxtest::write_file(oxtest::kNodeInfo, node_text(attempt), 1000 + attempt);
+        sec__lock_read(&idmutex);  // the query's promotion waits for this share
+        Thread query([] { (void)sec_is_in_any_cluster("h1"); });
+        ASSERT_TRUE(cluster_test::blocked_on(query.tid(), idmutex.writer_ok));
+        std::atomic<bool> holding{false}, release{false};
+        Thread writer([&] {
+            sec__lock_write(&idmutex);
+            holding.store(true);
+            while (!release.load()) usleep(100);
+            sec__unlock_write(&idmutex);
+        });
+        while (counts().waiting_writers != 2) usleep(100);
+        sec__unlock_read(&idmutex);
+        ASSERT_TRUE(cluster_test::eventually(holding));
+        const int kind = settle(query.tid());
+        if (kind == 1) {  // rebuilt, demoting, behind the writer
+            query.cancel();
+            EXPECT_TRUE(query.join());
+            const Counts c = counts();
+            EXPECT_EQ(c.lock_count, -1) << "only the writer holds the lock";
+            EXPECT_EQ(c.waiting_writers, 0u);
+            done = true;
+        }
+        release.store(true);
+        writer.join();
+        if (!done) query.join();  // the writer went first: the query finishes
+    }
+    ASSERT_TRUE(done) << "the query never reached its demotion behind the writer";
+    const Counts c = counts();
+    EXPECT_EQ(c.lock_count, 0);
+    EXPECT_EQ(c.waiting_writers, 0u);
+    // The cancelled query's reload stands; the next query needs no reload.
+    EXPECT_EQ(nametree.rst_node_cnt, 10u);
+    idm::clmap::MapHold hold(&idmutex);
+    char **clusters = nullptr;
+    int32_t count = 0;
+    ASSERT_EQ(sec__get_cluster_names(hold, "h1", &clusters, &count), 0);
+    EXPECT_GT(std::atoi(clusters[0] + 1), 0);
     EXPECT_TRUE(sweep::no_leaks());
 }
 
