@@ -139,7 +139,7 @@ class NoCancel {
 class FileHold {
   public:
     explicit FileHold(int fd) : fd_(fd) {}
-    ~FileHold() { close(); }
+    ~FileHold() { idm::forget_dead_frames(); close(); }
     int fd() const { return fd_; }
     void close() {
         if (fd_ >= 0) ::close(fd_);
@@ -568,6 +568,7 @@ MapHold::MapHold(sec_rwlock *lock) : lock_(lock) {
 }
 
 MapHold::~MapHold() {
+    idm::forget_dead_frames();
     if (mode_ == kRead) sec__unlock_read(lock_);
     else if (mode_ == kWrite) sec__unlock_write(lock_);
 }

@@ -267,7 +267,7 @@ int enumeration_error(int result) { return result > 0 ? result : errno; }
 class GroupScanHold {
   public:
     GroupScanHold() { pthread_mutex_lock(&idm__native_group_scan_mutex); }
-    ~GroupScanHold() { idm__thread_cleanup_group_scan(&idm__native_group_scan_mutex); }
+    ~GroupScanHold() { idm::forget_dead_frames(); idm__thread_cleanup_group_scan(&idm__native_group_scan_mutex); }
     GroupScanHold(const GroupScanHold &) = delete;
     GroupScanHold &operator=(const GroupScanHold &) = delete;
 };

@@ -17,7 +17,7 @@ namespace {
 class WaitingReader {
   public:
     explicit WaitingReader(sec_rwlock *lock) : lock_(lock) {}
-    ~WaitingReader() { sec__waiting_reader_cleanup(lock_); }
+    ~WaitingReader() { idm::forget_dead_frames(); sec__waiting_reader_cleanup(lock_); }
     WaitingReader(const WaitingReader &) = delete;
     WaitingReader &operator=(const WaitingReader &) = delete;
 
@@ -30,7 +30,7 @@ class WaitingReader {
 class WaitingWriter {
   public:
     explicit WaitingWriter(sec_rwlock *lock) : lock_(lock) {}
-    ~WaitingWriter() { sec__waiting_writer_cleanup(lock_); }
+    ~WaitingWriter() { idm::forget_dead_frames(); sec__waiting_writer_cleanup(lock_); }
     WaitingWriter(const WaitingWriter &) = delete;
     WaitingWriter &operator=(const WaitingWriter &) = delete;
 
