@@ -13,6 +13,7 @@ extern "C" {
 
 unsigned char idm__trace_detail_levels[5];
 pthread_once_t idm__trace_register_once = PTHREAD_ONCE_INIT;
+unsigned char idm__trace_registered = 0;
 const char *null_string = "<null>";
 
 // Category table as libox_tr receives it: number, name, a null field.
@@ -31,7 +32,10 @@ int idm__trace_register_oxidm(void) {
     return rc;
 }
 
-void idm__trace_register_once_routine(void) { (void)idm__trace_register_oxidm(); }
+void idm__trace_register_once_routine(void) {
+    (void)idm__trace_register_oxidm();
+    __atomic_store_n(&idm__trace_registered, 1, __ATOMIC_RELEASE);
+}
 
 int idm__trace_unregister_oxidm(void) { return tr_unregister_component_1(trace::kComponent); }
 
