@@ -25,6 +25,9 @@ bool g_open_any = false;
 std::string *g_time_path = new std::string;
 int g_time_result = 0;
 bool g_time_any = false;
+// Set while a time-query result is forced: the query takes g_mutex only
+// then, so that an ordinary query costs the stat and nothing else.
+std::atomic<bool> g_time_forced{false};
 std::atomic<int> g_lock_result{0};
 
 int forced(const std::string &want, bool any, int result, const char *path) {
@@ -108,7 +111,7 @@ extern "C" int sec__close_file(int *fd) {
 
 extern "C" int sec__time_file(const char *path, uint32_t *mtime) {
     if (!path || !mtime) return 23;
-    {
+    if (g_time_forced.load(std::memory_order_acquire)) {
         std::lock_guard<std::mutex> lock(g_mutex);
         if (int r = forced(*g_time_path, g_time_any, g_time_result, path)) return r;
     }
@@ -135,6 +138,7 @@ extern "C" void mssx_force_time(const char *path, int result) {
     *g_time_path = path ? path : "";
     g_time_any = path == nullptr;
     g_time_result = result;
+    g_time_forced.store(result != 0, std::memory_order_release);
 }
 extern "C" long mssx_locks_held(void) { return g_locks.load(); }
 extern "C" void mssx_reset(void) {
