@@ -32,6 +32,13 @@
 
 namespace {
 
+// A prefix and a number as one text, built by appending.
+std::string num(const char *prefix, long n) {
+    std::string s(prefix);
+    s += std::to_string(n);
+    return s;
+}
+
 using cluster_test::Thread;
 
 // Iterations of each cancellation loop: more in the long form.
@@ -117,19 +124,19 @@ int32_t cleanup(idm_rule *, idm_id *) {
 constexpr int kLines = 150;
 std::string local_file(int v) {
     std::string t;
-    for (int i = 0; i < kLines; ++i) t += "rc:u" + std::to_string(i) + "=l" + std::to_string(v % 2) + "\n";
+    for (int i = 0; i < kLines; ++i) t += num("rc:u", i) + num("=l", v % 2) + "\n";
     return t;
 }
 std::string global_file(int v) {
     std::string t;
-    for (int i = 0; i < kLines; ++i) t += "rc:g" + std::to_string(i) + "=x\nother:joe=nobody\n";
-    return t + "rc:joe=j" + std::to_string(v % 2) + "\n";
+    for (int i = 0; i < kLines; ++i) t += num("rc:g", i) + "=x\nother:joe=nobody\n";
+    return t + num("rc:joe=j", v % 2) + "\n";
 }
 
 std::string map_joe() {
     idm_buffer local{};
     const int32_t status = sec_idm_map_identity("rc", "joe", &local);
-    std::string answer = status == 0 && local.value != nullptr ? local.value : "status " + std::to_string(status);
+    std::string answer = status == 0 && local.value != nullptr ? local.value : num("status ", status);
     std::free(local.value);
     return answer;
 }
@@ -144,9 +151,9 @@ class CancelRandom : public oxtest::Test {
 
 TEST_F(CancelRandom, MappingThreadsInTheMpmAndTheReadingPass) {
     for (int i = 0; i < kLines; ++i) {
-        add_rule("u" + std::to_string(i), "l0");
-        add_rule("u" + std::to_string(i), "l1");
-        add_rule("g" + std::to_string(i), "x");
+        add_rule(num("u", i), "l0");
+        add_rule(num("u", i), "l1");
+        add_rule(num("g", i), "x");
     }
     add_rule("joe", "j0");
     add_rule("joe", "j1");
@@ -213,7 +220,7 @@ TEST_F(CancelRandom, MappingThreadsInTheMpmAndTheReadingPass) {
     // The last version is in force.
     const int v = version.load() + 1;
     oxtest::write_file(oxtest::kVarGlobalMap, global_file(v), 900000);
-    EXPECT_EQ(map_joe(), "j" + std::to_string(v % 2));
+    EXPECT_EQ(map_joe(), num("j", v % 2));
     EXPECT_TRUE(sweep::no_leaks());
 }
 
@@ -227,8 +234,8 @@ std::string node_text(int v) {
     std::snprintf(number, sizeof number, "%07d", v);
     std::string t;
     for (int h = 0; h < 10; ++h)
-        t += "NODE:\nNAME: h" + std::to_string(h) + "\nADDRESS: 10.0.0." + std::to_string(h) + "\nCLUSTER: v" +
-             number + " m" + std::to_string(v % 7) + "\n";
+        t += num("NODE:\nNAME: h", h) + num("\nADDRESS: 10.0.0.", h) + "\nCLUSTER: v" +
+             number + num(" m", v % 7) + "\n";
     return t;
 }
 
@@ -245,7 +252,7 @@ Counts counts() {
 
 // What a thread is blocked on right now: 1 readers_ok, 2 writer_ok, 0 other.
 int blocked_kind(pid_t tid) {
-    std::ifstream f("/proc/self/task/" + std::to_string(tid) + "/syscall");
+    std::ifstream f(num("/proc/self/task/", tid) + "/syscall");
     long nr = -1;
     std::string arg;
     if (!(f >> nr >> arg) || nr != SYS_futex) return 0;
@@ -292,7 +299,7 @@ TEST_F(CancelRandom, ClusterQueriesAndWritersWhileTheFileChanges) {
         const int kind = i % 4;
         Thread victim([kind, &wrong] {
             for (int n = 0;; ++n) {
-                const std::string host = (n % 2 ? "h" : "10.0.0.") + std::to_string(n % 10);
+                const std::string host = num(n % 2 ? "h" : "10.0.0.", n % 10);
                 switch (kind) {
                 case 0:
                     if (sec_is_in_any_cluster(host.c_str()) != 1) wrong.fetch_add(1);

@@ -25,6 +25,7 @@
 #include <cstdlib>
 #include <cstring>
 #include <fstream>
+#include <mutex>
 #include <string>
 #include <thread>
 #include <vector>
@@ -34,6 +35,13 @@
 #include "oxidm_internal.h"
 
 namespace {
+
+// A prefix and a number as one text, built by appending.
+std::string num(const char *prefix, long n) {
+    std::string s(prefix);
+    s += std::to_string(n);
+    return s;
+}
 
 using Clock = std::chrono::steady_clock;
 
@@ -50,24 +58,24 @@ double stress_seconds() {
 
 // ---- map files and the version-checking translator ----
 
-std::string mech(int m) { return "s" + std::to_string(m); }
+std::string mech(int m) { return num("s", m); }
 
 // Local version v: per mechanism, kFiller entries, a denial, and "joe".
 std::string local_text(int v) {
-    std::string t = "# local " + std::to_string(v) + "\n";
+    std::string t = num("# local ", v) + "\n";
     for (int m = 0; m < kMechanisms; ++m) {
-        for (int i = 0; i < kFiller; ++i) t += mech(m) + ":L" + std::to_string(v) + ".a" + std::to_string(i) + "=x\n";
-        t += mech(m) + ":!L" + std::to_string(v) + ".eve\n";
-        t += mech(m) + ":L" + std::to_string(v) + ".joe=" + mech(m) + "l" + std::to_string(v) + "\n";
+        for (int i = 0; i < kFiller; ++i) t += mech(m) + num(":L", v) + num(".a", i) + "=x\n";
+        t += mech(m) + num(":!L", v) + ".eve\n";
+        t += mech(m) + num(":L", v) + ".joe=" + mech(m) + num("l", v) + "\n";
     }
     return t;
 }
 // Global version v: per mechanism, kFiller entries and "ann".
 std::string global_text(int v) {
-    std::string t = "# global " + std::to_string(v) + "\n";
+    std::string t = num("# global ", v) + "\n";
     for (int m = 0; m < kMechanisms; ++m) {
-        for (int i = 0; i < kFiller; ++i) t += mech(m) + ":G" + std::to_string(v) + ".b" + std::to_string(i) + "=y\n";
-        t += mech(m) + ":G" + std::to_string(v) + ".ann=" + mech(m) + "g" + std::to_string(v) + "\n";
+        for (int i = 0; i < kFiller; ++i) t += mech(m) + num(":G", v) + num(".b", i) + "=y\n";
+        t += mech(m) + num(":G", v) + ".ann=" + mech(m) + num("g", v) + "\n";
     }
     return t;
 }
@@ -150,8 +158,8 @@ bool map_and_check(int m, int n) {
     if (w.local >= 0 && w.global >= 0 && w.global < w.local - 1) return false;
     const std::string prefix = mech(m);
     switch (n % 4) {
-    case 0: return w.local >= 0 && answer == prefix + "l" + std::to_string(w.local);
-    case 1: return w.global >= 0 && answer == prefix + "g" + std::to_string(w.global);
+    case 0: return w.local >= 0 && answer == prefix + num("l", w.local);
+    case 1: return w.global >= 0 && answer == prefix + num("g", w.global);
     default: return answer.empty();  // a denial, or no entry matched
     }
 }
@@ -165,28 +173,40 @@ std::string node_text(int v) {
     std::snprintf(number, sizeof number, "%07d", v);
     std::string t;
     for (int h = 0; h < kHosts; ++h)
-        t += "NODE:\nNAME: h" + std::to_string(h) + "\nADDRESS: 10.0.0." + std::to_string(h) + "\nCLUSTER: v" +
-             number + " m" + std::to_string(v % 7) + "\n";
+        t += num("NODE:\nNAME: h", h) + num("\nADDRESS: 10.0.0.", h) + "\nCLUSTER: v" +
+             number + num(" m", v % 7) + "\n";
     return t;
 }
 
 // Under one read share: the host's answer, and every host of the trees, of
-// one version.
-bool query_and_check(int n) {
-    const std::string host = (n % 2 ? "h" : "10.0.0.") + std::to_string(n % kHosts);
-    if (n % 4 == 0) return sec_is_in_any_cluster(host.c_str()) == 1;
+// one version.  Returns "" or what was wrong.
+std::string query_and_check(int n) {
+    const std::string host = num(n % 2 ? "h" : "10.0.0.", n % kHosts);
+    auto failed = [&](const char *what) {
+        oxtest::Error e = oxtest::last_error();
+        std::string why = std::string(what) + " for " + host + " (last error on this thread " +
+                          std::to_string(e.msgno) + "; trees " + std::to_string(nametree.rst_node_cnt) + "/" +
+                          std::to_string(iptree.rst_node_cnt) + "; lastmod " +
+                          std::to_string(__atomic_load_n(&lastmod, __ATOMIC_RELAXED)) + ")";
+        oxtest::clear_errors();
+        return why;
+    };
+    if (n % 4 == 0) return sec_is_in_any_cluster(host.c_str()) == 1 ? "" : failed("public query not 1");
     idm::clmap::MapHold hold(&idmutex);
     char **clusters = nullptr;
     int32_t count = 0;
-    if (sec__get_cluster_names(hold, host.c_str(), &clusters, &count) != 0 || count != 2) return false;
+    const int32_t status = sec__get_cluster_names(hold, host.c_str(), &clusters, &count);
+    if (status != 0) return failed(("lookup status " + std::to_string(status)).c_str());
+    if (count != 2) return failed("not two clusters");
     const int version = std::atoi(clusters[0] + 1);
-    if (std::atoi(clusters[1] + 1) != version % 7) return false;
-    if (nametree.rst_node_cnt != kHosts || iptree.rst_node_cnt != kHosts) return false;
-    const std::string other = "h" + std::to_string((n + 3) % kHosts);
+    if (std::atoi(clusters[1] + 1) != version % 7) return failed("clusters of two versions");
+    if (nametree.rst_node_cnt != kHosts || iptree.rst_node_cnt != kHosts) return failed("partial trees");
+    const std::string other = num("h", (n + 3) % kHosts);
     idm_clnode probe{const_cast<char *>(other.c_str()), nullptr, 0};
     void *item = &probe;
-    if (sec__rst_find(&nametree, &item) != 1) return false;
-    return std::atoi(static_cast<idm_clnode *>(item)->clusters[0] + 1) == version;
+    if (sec__rst_find(&nametree, &item) != 1) return failed("host missing");
+    if (std::atoi(static_cast<idm_clnode *>(item)->clusters[0] + 1) != version) return failed("hosts of two versions");
+    return "";
 }
 
 // ---- groups ----
@@ -243,10 +263,16 @@ TEST_F(Stress, MappingClusterAndGroupThreadsAgainstRewrittenFiles) {
     int32_t group_status = 0;
     const std::vector<std::string> groups = groups_of(user, &group_status);
     for (int m = 0; m < kMechanisms; ++m) ASSERT_TRUE(map_and_check(m, 0));
+    // The first version is loaded before the threads start: a query that
+    // finds a load under way answers from the trees as they were, which
+    // before any load are empty.
+    ASSERT_EQ(sec_is_in_any_cluster("h0"), 1);
 
     std::atomic<bool> stop{false};
     std::atomic<long> mappings{0}, queries{0}, lookups{0}, map_writes{0}, node_writes{0};
     std::atomic<long> bad_mappings{0}, bad_queries{0}, bad_lookups{0};
+    std::mutex first_bad_mutex;
+    std::string first_bad_query;
     std::vector<std::thread> threads;
     for (int t = 0; t < kMappers; ++t)
         threads.emplace_back([&, t] {
@@ -258,7 +284,12 @@ TEST_F(Stress, MappingClusterAndGroupThreadsAgainstRewrittenFiles) {
     for (int t = 0; t < kQueriers; ++t)
         threads.emplace_back([&, t] {
             for (int n = t; !stop.load(std::memory_order_relaxed); ++n) {
-                if (!query_and_check(n)) bad_queries.fetch_add(1);
+                if (std::string why = query_and_check(n); !why.empty()) {
+                    if (bad_queries.fetch_add(1) == 0) {
+                        std::lock_guard<std::mutex> lock(first_bad_mutex);
+                        first_bad_query = why;
+                    }
+                }
                 queries.fetch_add(1, std::memory_order_relaxed);
             }
         });
@@ -313,7 +344,7 @@ TEST_F(Stress, MappingClusterAndGroupThreadsAgainstRewrittenFiles) {
     const double total = std::chrono::duration<double>(Clock::now() - begin).count();
 
     EXPECT_EQ(bad_mappings.load(), 0) << "of " << mappings.load() << " mappings";
-    EXPECT_EQ(bad_queries.load(), 0) << "of " << queries.load() << " queries";
+    EXPECT_EQ(bad_queries.load(), 0) << "of " << queries.load() << " queries; first: " << first_bad_query;
     EXPECT_EQ(bad_lookups.load(), 0) << "of " << lookups.load() << " group lookups";
     EXPECT_GT(mappings.load(), 0);
     EXPECT_GT(queries.load(), 0);

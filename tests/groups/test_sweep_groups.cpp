@@ -18,6 +18,13 @@
 
 namespace {
 
+// A prefix and a number as one text, built by appending.
+std::string num(const char *prefix, long n) {
+    std::string s(prefix);
+    s += std::to_string(n);
+    return s;
+}
+
 using Names = std::vector<std::string>;
 
 std::string passwd_db() {
@@ -32,8 +39,8 @@ std::string group_db(Names *expected) {
     expected->assign({"g3000"});
     for (int i = 1; i <= 12; ++i) {
         const std::string name = "group-" + std::string(i, 'x');  // names of growing length
-        text += "other" + std::to_string(i) + ":x:" + std::to_string(3100 + i) + ":someone\n";
-        text += name + ":x:" + std::to_string(3000 + i) + ":a,many" + (i == 7 ? ",many" : "") + ",b\n";
+        text += num("other", i) + num(":x:", 3100 + i) + ":someone\n";
+        text += name + num(":x:", 3000 + i) + ":a,many" + (i == 7 ? ",many" : "") + ",b\n";
         expected->push_back(name);
         if (i == 7) expected->push_back(name);
     }

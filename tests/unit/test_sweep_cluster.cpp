@@ -10,6 +10,13 @@
 
 namespace {
 
+// A prefix and a number as one text, built by appending.
+std::string num(const char *prefix, long n) {
+    std::string s(prefix);
+    s += std::to_string(n);
+    return s;
+}
+
 using oxtest::kNodeInfo;
 using sweep::Row;
 
@@ -44,13 +51,13 @@ bool lock_is_free() {
 // repeat's node is released) and gives 34 names, so that the names list
 // fills its 32 entries and grows.
 std::string new_text(long n) {
-    const std::string v = "v" + std::to_string(n);
-    std::string t = "# version " + std::to_string(n) + "\n";
+    const std::string v = num("v", n);
+    std::string t = num("# version ", n) + "\n";
     t += "NODE:\n  NAME: hosta hosta-alt\n  ADDRESS: 10.1.1.1 fd00::1\n  CLUSTER: " + v + " clA\n";
     t += "node: name: hostb\ncluster: " + v + " clB\n";
     t += "NODE:\nADDRESS: 10.1.1.2\nCLUSTER: " + v + "\n";
     t += "NODE:\nNAME: hosta";
-    for (int i = 0; i < 33; ++i) t += " n" + std::to_string(i);
+    for (int i = 0; i < 33; ++i) t += num(" n", i);
     t += "\nCLUSTER: dup\n";
     return t;
 }
@@ -59,8 +66,8 @@ const char kOldText[] = "NODE:\nNAME: hosta\nCLUSTER: old\n";
 // The values of new_text(n), in no particular order.
 std::vector<std::string> values_of(long n) {
     std::vector<std::string> v = {"hosta", "hosta-alt", "10.1.1.1", "fd00::1", "hostb", "10.1.1.2",
-                                  "clA",   "clB",       "dup",      "v" + std::to_string(n)};
-    for (int i = 0; i < 33; ++i) v.push_back("n" + std::to_string(i));
+                                  "clA",   "clB",       "dup",      num("v", n)};
+    for (int i = 0; i < 33; ++i) v.push_back(num("n", i));
     return v;
 }
 
@@ -106,7 +113,7 @@ TEST_F(SweepCluster, EveryAllocationOfALoadOfSeveralRecords) {
     int64_t mtime = 10000;
     std::vector<long> probe_steps;  // steps whose failure hit the lookup's probe
     const Lookup kOld{0, {"old"}};
-    auto fresh = [](long n) { return Lookup{0, {"v" + std::to_string(n), "clA"}}; };
+    auto fresh = [](long n) { return Lookup{0, {num("v", n), "clA"}}; };
     int steps = sweep::run([&](long n) {
         oxtest::write_file(kNodeInfo, kOldText, mtime += 10);
         EXPECT_EQ(lookup("hosta"), kOld);
@@ -154,9 +161,9 @@ TEST_F(SweepCluster, EveryAllocationOfALoadOfSeveralRecords) {
         // A change of the file loads it whole.
         oxtest::set_mtime(kNodeInfo, mtime += 10);
         EXPECT_EQ(lookup("hosta"), fresh(n));
-        EXPECT_EQ(lookup("hostb"), (Lookup{0, {"v" + std::to_string(n), "clB"}}));
+        EXPECT_EQ(lookup("hostb"), (Lookup{0, {num("v", n), "clB"}}));
         EXPECT_EQ(lookup("fd00::1"), fresh(n));
-        EXPECT_EQ(lookup("10.1.1.2"), (Lookup{0, {"v" + std::to_string(n)}}));
+        EXPECT_EQ(lookup("10.1.1.2"), (Lookup{0, {num("v", n)}}));
         EXPECT_EQ(lookup("n32"), (Lookup{0, {"dup"}}));
         EXPECT_EQ(nametree.rst_node_cnt, 36u);
         EXPECT_EQ(iptree.rst_node_cnt, 3u);

@@ -13,6 +13,13 @@
 
 namespace {
 
+// A prefix and a number as one text, built by appending.
+std::string num(const char *prefix, long n) {
+    std::string s(prefix);
+    s += std::to_string(n);
+    return s;
+}
+
 using oxtest::Error;
 using sweep::Row;
 
@@ -172,7 +179,7 @@ TEST_F(SweepMapping, EveryAllocationOfAPassThatReadsTwoFilesAndCachesRules) {
     int64_t mtime = 100000;
     int steps = sweep::run([&](long n) {
         // A mechanism of its own per step: a fresh record, no set, no cache.
-        const std::string mech = "sw" + std::to_string(n);
+        const std::string mech = num("sw", n);
         EXPECT_EQ(sec_idm_register_translator(1, mech.c_str(), translate, cleanup), 0);
         oxtest::write_file(oxtest::kLocalMap, file_for(mech, kLocalLines), mtime += 10);
         oxtest::write_file(oxtest::kVarGlobalMap, file_for(mech, kGlobalLines), mtime);
