@@ -216,13 +216,14 @@ def print_text(table):
 
 
 def print_markdown(table):
-    print('| ' + ' | '.join(HEAD) + ' |')
-    print('|' + '---|' * len(HEAD))
+    head = HEAD + ('note',)
+    print('| ' + ' | '.join(head) + ' |')
+    print('|' + '---|' * len(head))
     for r in table:
         if r[0] == 'section':
-            print('| **%s** |' % r[1] + ' |' * (len(HEAD) - 1))
+            print('| **%s** |' % r[1] + ' |' * (len(head) - 1))
             continue
-        print('| ' + ' | '.join(x.replace('|', '/') for x in r[1:1 + len(HEAD)]) + ' |')
+        print('| ' + ' | '.join(x.replace('|', '/') for x in r[1:1 + len(head)]) + ' |')
 
 
 def main():
