@@ -97,42 +97,42 @@ def fmt_value(v):
     return '%.3g' % v
 
 
-def resolve(spec, runs):
-    """(value, is_time, shown text) or (None, ..., why).  A spec may also be
+def resolve(cell, runs):
+    """(value, is_time, shown text) or (None, ..., why).  A cell may also be
     a difference "A - B" or carry a factor "3*A"."""
-    m = re.fullmatch(r'([0-9.eE+-]+)\*\((.+)\)', spec)
+    m = re.fullmatch(r'([0-9.eE+-]+)\*\((.+)\)', cell)
     if m:
         v, is_time, why = resolve(m.group(2), runs)
         if v is None:
             return v, is_time, why
         v *= float(m.group(1))
         return v, is_time, fmt_time(v) if is_time else fmt_value(v)
-    if ' - ' in spec:
-        parts = [resolve(x.strip(), runs) for x in spec.split(' - ')]
+    if ' - ' in cell:
+        parts = [resolve(x.strip(), runs) for x in cell.split(' - ')]
         for v, _, why in parts:
             if v is None:
                 return None, True, why
         v = parts[0][0] - sum(p[0] for p in parts[1:])
         return v, parts[0][1], fmt_time(v) if parts[0][1] else fmt_value(v)
-    m = re.fullmatch(r'([0-9.]+)\*(.+)', spec)
+    m = re.fullmatch(r'([0-9.]+)\*(.+)', cell)
     if m:
         v, is_time, why = resolve(m.group(2), runs)
         if v is None:
             return v, is_time, why
         v *= float(m.group(1))
         return v, is_time, (fmt_time(v) if is_time else fmt_value(v)) + ' (%sx)' % m.group(1)
-    if spec in ('', '-'):
+    if cell in ('', '-'):
         return None, True, ''
-    if spec.startswith('='):
-        m = re.fullmatch(r'=([0-9.eE+-]+)\s*(ns|us|ms|s)?', spec)
+    if cell.startswith('='):
+        m = re.fullmatch(r'=([0-9.eE+-]+)\s*(ns|us|ms|s)?', cell)
         if not m:
-            return None, True, 'bad constant ' + spec
+            return None, True, 'bad constant ' + cell
         if m.group(2):
             v = float(m.group(1)) * UNITS[m.group(2)]
             return v, True, 'budget ' + fmt_time(v)
         v = float(m.group(1))
         return v, False, 'target ' + fmt_value(v)
-    name, _, counter = spec.partition('@')
+    name, _, counter = cell.partition('@')
     r = runs.get(name)
     if r is None:
         return None, True, 'missing: ' + name
@@ -143,7 +143,7 @@ def resolve(spec, runs):
     t, counters = best(r)
     if counter:
         if counter not in counters:
-            return None, False, 'no counter ' + spec
+            return None, False, 'no counter ' + cell
         v = counters[counter]
         return v, False, fmt_value(v)
     return t, True, fmt_time(t)
