@@ -11,6 +11,7 @@
 #include <cstdlib>
 #include <cstring>
 #include <mutex>
+#include <pthread.h>
 #include <set>
 #include <unordered_map>
 #include <string>
@@ -259,11 +260,15 @@ extern "C" int cu_get_cluster_info_1(cu_cluster_info_t *info) {
             overridden = g_cluster_override;
         }
         if (overridden) return 1;
+        // A short read of a small file, with cancellation off so that a
+        // cancelled caller does not leave the stream open.
+        int cancel_state;
+        pthread_setcancelstate(PTHREAD_CANCEL_DISABLE, &cancel_state);
         FILE *f = std::fopen(CU_ACTIVE_CLUSTER_FILE, "re");
-        if (!f) return 1;
         char line[256];
-        bool got = std::fgets(line, sizeof line, f) != nullptr;
-        std::fclose(f);
+        bool got = f != nullptr && std::fgets(line, sizeof line, f) != nullptr;
+        if (f) std::fclose(f);
+        pthread_setcancelstate(cancel_state, nullptr);
         if (!got) return 1;
         line[std::strcspn(line, "\r\n")] = '\0';
         name = line;

@@ -122,18 +122,12 @@ class OldTrees {
     rst_tree addresses_{};
 };
 
-// Disables thread cancellation for the scope: a rebuild of the trees runs to
-// its end once it has begun.
-class NoCancel {
-  public:
-    NoCancel() { pthread_setcancelstate(PTHREAD_CANCEL_DISABLE, &old_); }
-    ~NoCancel() { pthread_setcancelstate(old_, nullptr); }
-    NoCancel(const NoCancel &) = delete;
-    NoCancel &operator=(const NoCancel &) = delete;
-
-  private:
-    int old_ = PTHREAD_CANCEL_ENABLE;
-};
+// Opens the node information file with cancellation off, so that the new
+// descriptor always reaches its hold.
+int open_uncancelled(const char *path) {
+    NoCancel no_cancel;
+    return ::open(path, O_RDONLY | O_CLOEXEC);
+}
 
 // The descriptor of the file being read; closed at the end of the scope.
 class FileHold {
@@ -141,9 +135,14 @@ class FileHold {
     explicit FileHold(int fd) : fd_(fd) {}
     ~FileHold() { idm::forget_dead_frames(); close(); }
     int fd() const { return fd_; }
+    // The number is given up before the call: a second close of it could
+    // close a descriptor another thread has opened since.
     void close() {
-        if (fd_ >= 0) ::close(fd_);
+        if (fd_ < 0) return;
+        idm::NoCancel no_cancel;
+        const int fd = fd_;
         fd_ = -1;
+        ::close(fd);
     }
     FileHold(const FileHold &) = delete;
     FileHold &operator=(const FileHold &) = delete;
@@ -536,7 +535,7 @@ int32_t load(MapHold &hold) {
     // the time changes again.
     store_lastmod(st.st_mtime);
     ReloadUnlessDone reload;
-    FileHold file(::open(kNodeInfoPath, O_RDONLY | O_CLOEXEC));
+    FileHold file(open_uncancelled(kNodeInfoPath));
     if (file.fd() < 0) {
         reload.done();
         return report(21, kMsg693);
@@ -599,7 +598,7 @@ int32_t idm__construct_clcfg(MapHold &hold, const char *text, size_t size) {
     int32_t status = builder.allocate_lists();
     hold.promote();
     {
-        idm::clmap::NoCancel no_cancel;
+        idm::NoCancel no_cancel;
         old.take();
         if (status == 0) {
             const idm::clmap::ParseSink sink = builder.sink();

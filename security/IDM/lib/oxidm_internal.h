@@ -169,6 +169,23 @@ inline void forget_dead_frames() { __asan_handle_no_return(); }
 inline void forget_dead_frames() {}
 #endif
 
+// Disables thread cancellation for the scope.  Used where a step must run
+// to its end once begun (a rebuild of the cluster trees), and around the
+// creation and the closing of a descriptor: glibc acts on a cancellation
+// that arrives just as open returns, which would leave the new descriptor
+// open with no one owning it, or just as close returns, which would make
+// the clean-up close the number again.
+class NoCancel {
+  public:
+    NoCancel() { pthread_setcancelstate(PTHREAD_CANCEL_DISABLE, &old_); }
+    ~NoCancel() { pthread_setcancelstate(old_, nullptr); }
+    NoCancel(const NoCancel &) = delete;
+    NoCancel &operator=(const NoCancel &) = delete;
+
+  private:
+    int old_ = PTHREAD_CANCEL_ENABLE;
+};
+
 // Holds a POSIX mutex; the destructor is the cancellation clean-up.
 class MutexHold {
   public:

@@ -148,22 +148,27 @@ class MapfileHold {
 // cancellation during the lock wait.
 class DescriptorHold {
   public:
-    explicit DescriptorHold(int32_t fd) : fd_(fd) {}
+    DescriptorHold() = default;
     ~DescriptorHold() { idm::forget_dead_frames(); close(); }
+    void own(int32_t fd) { fd_ = fd; }
     void locked() { locked_ = true; }
+    // Runs to its end once begun: the number is given up before the close,
+    // so that it is never closed twice.
     void close() {
         if (fd_ < 0) return;
-        if (locked_) sec__unlock_file(fd_, "idm__ready_mapfile");
-        locked_ = false;
-        sec__close_file(&fd_);
+        idm::NoCancel no_cancel;
+        int32_t fd = fd_;
         fd_ = -1;
+        if (locked_) sec__unlock_file(fd, "idm__ready_mapfile");
+        locked_ = false;
+        sec__close_file(&fd);
     }
     void release() { fd_ = -1; }
     DescriptorHold(const DescriptorHold &) = delete;
     DescriptorHold &operator=(const DescriptorHold &) = delete;
 
   private:
-    int fd_;
+    int32_t fd_ = -1;
     bool locked_ = false;
 };
 
@@ -386,7 +391,16 @@ int32_t idm__ready_mapfile(const char *path, int32_t *fd, FILE **stream) {
     if (fd == nullptr) return bad(2, 0);
     if (stream == nullptr) return bad(3, 0);
 
-    int r = sec__open_file(path, 0, &d);
+    // The descriptor is created and given to its hold with cancellation
+    // off, so that it cannot be left open by a cancellation acted on as the
+    // open returns.
+    DescriptorHold hold;
+    int r;
+    {
+        idm::NoCancel no_cancel;
+        r = sec__open_file(path, 0, &d);
+        if (r == 0) hold.own(d);
+    }
     if (trace::diag_on()) trace::record_data(30, trace::text(path), trace::i32(r), trace::i32(d));
     switch (r) {
     case 0: break;
@@ -395,7 +409,6 @@ int32_t idm__ready_mapfile(const char *path, int32_t *fd, FILE **stream) {
     case 6: d = -1; return leave(report(36, kMsg654, kName, 0));
     default: d = -1; return leave(report(23, kMsg655, "idm__open_mapfile", r, kName));
     }
-    DescriptorHold hold(d);
 
     r = sec__readlock_file(d, kName);
     if (trace::diag_on()) trace::record_data(31, trace::text(path), trace::i32(r));
@@ -806,6 +819,7 @@ int32_t idm__native_read_mapfiles(const char *mechanism, idm_mapfile_set **set, 
             hold.buffer_stream();
             if (trace::diag_on()) trace::record_data(9, trace::text(open.path));
             status = idm__parse_mapfile(mechanism, open.path, open.stream, &list.count, &list.entries);
+            idm::NoCancel no_cancel;
             sec__unlock_file(open.fd, kName);
             FILE *stream = open.stream;
             open.stream = nullptr;
