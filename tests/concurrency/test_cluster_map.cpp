@@ -59,7 +59,8 @@ int tree_version() {
     if (nametree.rst_node_cnt != kHosts || iptree.rst_node_cnt != kHosts) return -2;
     int version = -3;
     for (int h = 0; h < 2 * kHosts; ++h) {
-        std::string key = h < kHosts ? "h" + std::to_string(h) : "10.0.0." + std::to_string(h - kHosts);
+        std::string key = h < kHosts ? "h" : "10.0.0.";  // appended: GCC 12 -O3 misreads literal + string
+        key += std::to_string(h < kHosts ? h : h - kHosts);
         idm_clnode probe{key.data(), nullptr, 0};
         void *item = &probe;
         if (sec__rst_find(h < kHosts ? &nametree : &iptree, &item) != 1) return -2;
