@@ -26,18 +26,14 @@
 
 #include "../unit/test_sweep.h"
 #include "harness.h"
+#include "test_mpm.h"
 #include "oxidm_clmap.h"
 #include "oxidm_internal.h"
 #include "test_cluster_threads.h"
 
 namespace {
 
-// A prefix and a number as one text, built by appending.
-std::string num(const char *prefix, long n) {
-    std::string s(prefix);
-    s += std::to_string(n);
-    return s;
-}
+using oxtest::num;
 
 using cluster_test::Thread;
 
@@ -161,7 +157,7 @@ TEST_F(CancelRandom, MappingThreadsInTheMpmAndTheReadingPass) {
     oxtest::write_file(oxtest::kLocalMap, local_file(0), 1000);
     oxtest::write_file(oxtest::kVarGlobalMap, global_file(0), 1000);
     ASSERT_EQ(map_joe(), "j0");
-    const int descriptors = sweep::open_descriptors();
+    const int descriptors = oxtest::open_descriptors();
 
     // The files change under the mappings all the time.
     std::atomic<bool> stop{false};
@@ -216,7 +212,7 @@ TEST_F(CancelRandom, MappingThreadsInTheMpmAndTheReadingPass) {
     EXPECT_TRUE(sweep::unlocked(&record->mutex));
     EXPECT_TRUE(sweep::unlocked(&idm__native_state.mutex));
     EXPECT_EQ(mssx_locks_held(), 0);
-    EXPECT_EQ(sweep::open_descriptors(), descriptors);
+    EXPECT_EQ(oxtest::open_descriptors(), descriptors);
     // The last version is in force.
     const int v = version.load() + 1;
     oxtest::write_file(oxtest::kVarGlobalMap, global_file(v), 900000);
@@ -269,7 +265,7 @@ TEST_F(CancelRandom, ClusterQueriesAndWritersWhileTheFileChanges) {
     oxtest::write_file(oxtest::kNodeInfo, node_text(0), 1000);
     cux_set_active_cluster("m0");
     ASSERT_EQ(sec_is_in_any_cluster("h1"), 1);
-    const int descriptors = sweep::open_descriptors();
+    const int descriptors = oxtest::open_descriptors();
 
     std::atomic<bool> stop{false};
     std::atomic<int> version{0};
@@ -341,7 +337,7 @@ TEST_F(CancelRandom, ClusterQueriesAndWritersWhileTheFileChanges) {
     const Counts c = counts();
     EXPECT_EQ(c.lock_count, 0);
     EXPECT_EQ(c.waiting_writers, 0u);
-    EXPECT_EQ(sweep::open_descriptors(), descriptors);
+    EXPECT_EQ(oxtest::open_descriptors(), descriptors);
     // The next query loads the last version, whatever a cancelled load left.
     const int v = version.load() + 1;
     oxtest::write_file(oxtest::kNodeInfo, node_text(v), 900000);

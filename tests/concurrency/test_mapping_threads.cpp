@@ -15,6 +15,7 @@
 #include <vector>
 
 #include "harness.h"
+#include "test_mpm.h"
 #include "oxidm_internal.h"
 
 namespace {
@@ -32,50 +33,29 @@ constexpr int kEntries = 12;
 thread_local std::string t_version;  // version of the first rule of this walk
 thread_local int t_mixed = 0;
 
-char *copy(const char *s) { return strcpy(static_cast<char *>(std::malloc(std::strlen(s) + 1)), s); }
+using oxtest::heap_copy;
 
 int32_t version_translate(const idm_mapfile_entry *entry, const char *network_id, idm_rule *rule, idm_id *id) {
     if (entry != nullptr) {
         std::string nid = entry->network_id;
         std::string version = nid.substr(0, nid.find('.'));
         std::string token = nid.substr(nid.find('.') + 1);
-        rule->rgy_type = copy(version.c_str());
-        rule->rgy = copy("r");
+        rule->rgy_type = heap_copy(version.c_str());
+        rule->rgy = heap_copy("r");
         rule->token_cnt = 1;
-        rule->tokens = static_cast<char **>(std::malloc(sizeof(char *)));
-        rule->tokens[0] = copy(token.c_str());
-        rule->mapping = static_cast<idm_buffer *>(std::malloc(sizeof(idm_buffer)));
-        rule->mapping->value = copy(entry->local_id);
-        rule->mapping->length = static_cast<uint32_t>(std::strlen(entry->local_id) + 1);
+        rule->tokens = oxtest::one_token(token.c_str());
+        rule->mapping = oxtest::mapping_of(entry->local_id);
     }
     if (t_version.empty()) t_version = rule->rgy_type;
     else if (t_version != rule->rgy_type) ++t_mixed;
-    id->rgy_type = copy(t_version.c_str());
-    id->rgy = copy("r");
+    id->rgy_type = heap_copy(t_version.c_str());
+    id->rgy = heap_copy("r");
     id->token_cnt = 1;
-    id->tokens = static_cast<char **>(std::malloc(sizeof(char *)));
-    id->tokens[0] = copy(network_id);
+    id->tokens = oxtest::one_token(network_id);
     return 0;
 }
 
-int32_t version_cleanup(idm_rule *rule, idm_id *id) {
-    if (rule != nullptr) {
-        std::free(rule->rgy_type);
-        std::free(rule->rgy);
-        if (rule->tokens != nullptr) std::free(rule->tokens[0]);
-        std::free(rule->tokens);
-        if (rule->mapping != nullptr) std::free(rule->mapping->value);
-        std::free(rule->mapping);
-    }
-    if (id != nullptr) {
-        std::free(id->rgy_type);
-        std::free(id->rgy);
-        if (id->tokens != nullptr) std::free(id->tokens[0]);
-        std::free(id->tokens);
-        *id = idm_id{};
-    }
-    return 0;
-}
+int32_t version_cleanup(idm_rule *rule, idm_id *id) { return oxtest::free_rule_and_id(rule, id); }
 
 std::string version_file(int v) {
     std::string text;

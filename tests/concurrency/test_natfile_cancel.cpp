@@ -18,6 +18,7 @@
 #include <vector>
 
 #include "harness.h"
+#include "test_mpm.h"
 #include "oxidm_internal.h"
 #include "oxidm_natfile.h"
 
@@ -38,14 +39,7 @@ namespace {
 
 using oxtest::kLocalMap;
 
-int open_descriptors() {
-    int n = 0;
-    DIR *d = opendir("/proc/self/fd");
-    while (dirent *e = readdir(d))
-        if (e->d_name[0] != '.') ++n;
-    closedir(d);
-    return n;
-}
+using oxtest::open_descriptors;
 
 struct Pass {
     idm_mapfile_set *set = nullptr;

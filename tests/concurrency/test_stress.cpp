@@ -31,17 +31,14 @@
 #include <vector>
 
 #include "harness.h"
+#include "test_mpm.h"
 #include "oxidm_clmap.h"
 #include "oxidm_internal.h"
 
 namespace {
 
-// A prefix and a number as one text, built by appending.
-std::string num(const char *prefix, long n) {
-    std::string s(prefix);
-    s += std::to_string(n);
-    return s;
-}
+using oxtest::heap_copy;
+using oxtest::num;
 
 using Clock = std::chrono::steady_clock;
 
@@ -87,61 +84,32 @@ struct Walk {
 };
 thread_local Walk t_walk;
 
-char *copy(const char *s, size_t n) {
-    auto *c = static_cast<char *>(std::malloc(n + 1));
-    std::memcpy(c, s, n);
-    c[n] = '\0';
-    return c;
-}
-char *copy(const char *s) { return copy(s, std::strlen(s)); }
-
 // "L<v>.<token>": the rule's registry is "L<v>" (the id's is made equal, so
 // the registry always matches), its token <token>.
 int32_t translate(const idm_mapfile_entry *entry, const char *network_id, idm_rule *rule, idm_id *id) {
     if (entry != nullptr) {
         const char *dot = std::strchr(entry->network_id, '.');
         if (dot == nullptr) return 5;
-        rule->rgy_type = copy("st");
-        rule->rgy = copy(entry->network_id, static_cast<size_t>(dot - entry->network_id));
+        rule->rgy_type = heap_copy("st");
+        rule->rgy = heap_copy(entry->network_id, static_cast<size_t>(dot - entry->network_id));
         rule->token_cnt = 1;
-        rule->tokens = static_cast<char **>(std::malloc(sizeof(char *)));
-        rule->tokens[0] = copy(dot + 1);
+        rule->tokens = oxtest::one_token(dot + 1);
         if (entry->local_id != nullptr) {
-            rule->mapping = static_cast<idm_buffer *>(std::malloc(sizeof(idm_buffer)));
-            rule->mapping->value = copy(entry->local_id);
-            rule->mapping->length = static_cast<uint32_t>(std::strlen(entry->local_id) + 1);
+            rule->mapping = oxtest::mapping_of(entry->local_id);
         }
     }
     const long version = std::atol(rule->rgy + 1);
     long &seen = rule->rgy[0] == 'L' ? t_walk.local : t_walk.global;
     if (seen == -1) seen = version;
     else if (seen != version) t_walk.mixed = true;
-    id->rgy_type = copy("st");
-    id->rgy = copy(rule->rgy);
+    id->rgy_type = heap_copy("st");
+    id->rgy = heap_copy(rule->rgy);
     id->token_cnt = 1;
-    id->tokens = static_cast<char **>(std::malloc(sizeof(char *)));
-    id->tokens[0] = copy(network_id);
+    id->tokens = oxtest::one_token(network_id);
     return 0;
 }
 
-int32_t cleanup(idm_rule *rule, idm_id *id) {
-    if (rule != nullptr) {
-        std::free(rule->rgy_type);
-        std::free(rule->rgy);
-        if (rule->tokens != nullptr) std::free(rule->tokens[0]);
-        std::free(rule->tokens);
-        if (rule->mapping != nullptr) std::free(rule->mapping->value);
-        std::free(rule->mapping);
-    }
-    if (id != nullptr) {
-        std::free(id->rgy_type);
-        std::free(id->rgy);
-        if (id->tokens != nullptr) std::free(id->tokens[0]);
-        std::free(id->tokens);
-        *id = idm_id{};
-    }
-    return 0;
-}
+int32_t cleanup(idm_rule *rule, idm_id *id) { return oxtest::free_rule_and_id(rule, id); }
 
 // One mapping and its judgement: true when consistent with one version of
 // each file.

@@ -14,6 +14,7 @@
 #include <vector>
 
 #include "harness.h"
+#include "test_mpm.h"
 #include "oxidm_internal.h"
 #include "oxidm_natfile.h"
 
@@ -46,14 +47,7 @@ std::string hex_of(const void *p) {
     return b;
 }
 
-int open_descriptors() {
-    int n = 0;
-    DIR *d = opendir("/proc/self/fd");
-    while (dirent *e = readdir(d))
-        if (e->d_name[0] != '.') ++n;
-    closedir(d);
-    return n;
-}
+using oxtest::open_descriptors;
 
 // A reading pass's inputs and outputs as the mapping walk keeps them.
 struct Pass {

@@ -18,6 +18,7 @@
 #include <vector>
 
 #include "harness.h"
+#include "test_mpm.h"
 
 #if defined(__SANITIZE_ADDRESS__)
 #include <sanitizer/lsan_interface.h>
@@ -33,15 +34,6 @@ inline bool no_leaks() {
 #else
     return true;
 #endif
-}
-
-inline int open_descriptors() {
-    int n = 0;
-    DIR *d = opendir("/proc/self/fd");
-    while (dirent *e = readdir(d))
-        if (e->d_name[0] != '.') ++n;
-    closedir(d);
-    return n;
 }
 
 inline bool unlocked(pthread_mutex_t *m) {

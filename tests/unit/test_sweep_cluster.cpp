@@ -10,12 +10,7 @@
 
 namespace {
 
-// A prefix and a number as one text, built by appending.
-std::string num(const char *prefix, long n) {
-    std::string s(prefix);
-    s += std::to_string(n);
-    return s;
-}
+using oxtest::num;
 
 using oxtest::kNodeInfo;
 using sweep::Row;

@@ -13,12 +13,8 @@
 
 namespace {
 
-// A prefix and a number as one text, built by appending.
-std::string num(const char *prefix, long n) {
-    std::string s(prefix);
-    s += std::to_string(n);
-    return s;
-}
+using oxtest::heap_copy;
+using oxtest::num;
 
 using oxtest::Error;
 using sweep::Row;
@@ -41,53 +37,29 @@ void start_noting() {
     g_error_count = cux_error_count();
 }
 
-char *copy(const char *s) { return strcpy(static_cast<char *>(std::malloc(std::strlen(s) + 1)), s); }
 
-char **one_token(const char *s) {
-    auto **tokens = static_cast<char **>(std::malloc(sizeof(char *)));
-    tokens[0] = copy(s);
-    return tokens;
-}
 
 int32_t translate(const idm_mapfile_entry *entry, const char *network_id, idm_rule *rule, idm_id *id) {
     note_errors();
     if (entry != nullptr) {
-        rule->rgy_type = copy("sw");
-        rule->rgy = copy("R");
+        rule->rgy_type = heap_copy("sw");
+        rule->rgy = heap_copy("R");
         rule->token_cnt = 1;
-        rule->tokens = one_token(entry->network_id);
+        rule->tokens = oxtest::one_token(entry->network_id);
         if (entry->local_id != nullptr) {
-            rule->mapping = static_cast<idm_buffer *>(std::malloc(sizeof(idm_buffer)));
-            rule->mapping->value = copy(entry->local_id);
-            rule->mapping->length = static_cast<uint32_t>(std::strlen(entry->local_id) + 1);
+            rule->mapping = oxtest::mapping_of(entry->local_id);
         }
     }
-    id->rgy_type = copy("sw");
-    id->rgy = copy("R");
+    id->rgy_type = heap_copy("sw");
+    id->rgy = heap_copy("R");
     id->token_cnt = 1;
-    id->tokens = one_token(network_id);
+    id->tokens = oxtest::one_token(network_id);
     return 0;
 }
 
 int32_t cleanup(idm_rule *rule, idm_id *id) {
     note_errors();
-    if (rule != nullptr) {
-        std::free(rule->rgy_type);
-        std::free(rule->rgy);
-        if (rule->tokens != nullptr) std::free(rule->tokens[0]);
-        std::free(rule->tokens);
-        if (rule->mapping != nullptr) std::free(rule->mapping->value);
-        std::free(rule->mapping);
-        *rule = idm_rule{};
-    }
-    if (id != nullptr) {
-        std::free(id->rgy_type);
-        std::free(id->rgy);
-        if (id->tokens != nullptr) std::free(id->tokens[0]);
-        std::free(id->tokens);
-        *id = idm_id{};
-    }
-    return 0;
+    return oxtest::free_rule_and_id(rule, id);
 }
 
 // ---- the files: 13 entries, six local and seven global, so that the entry
@@ -183,7 +155,7 @@ TEST_F(SweepMapping, EveryAllocationOfAPassThatReadsTwoFilesAndCachesRules) {
         EXPECT_EQ(sec_idm_register_translator(1, mech.c_str(), translate, cleanup), 0);
         oxtest::write_file(oxtest::kLocalMap, file_for(mech, kLocalLines), mtime += 10);
         oxtest::write_file(oxtest::kVarGlobalMap, file_for(mech, kGlobalLines), mtime);
-        const int descriptors = sweep::open_descriptors();
+        const int descriptors = oxtest::open_descriptors();
         oxtest::clear_errors();
         start_noting();
 
@@ -197,7 +169,7 @@ TEST_F(SweepMapping, EveryAllocationOfAPassThatReadsTwoFilesAndCachesRules) {
         for (const Error &e : g_errors)
             if (e.msgno == idm::kMsg654 || e.msgno == idm::kMsg658) failures.push_back(e);
         EXPECT_EQ(mssx_locks_held(), 0);
-        EXPECT_EQ(sweep::open_descriptors(), descriptors);
+        EXPECT_EQ(oxtest::open_descriptors(), descriptors);
         idm_translator *record = idm__native_find_translator(mech.c_str());
         EXPECT_NE(record, nullptr);
         if (record != nullptr) {
