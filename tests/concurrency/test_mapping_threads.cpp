@@ -14,6 +14,7 @@
 #include <thread>
 #include <vector>
 
+#include "../unit/test_sweep.h"
 #include "harness.h"
 #include "test_mpm.h"
 #include "oxidm_internal.h"
@@ -210,6 +211,7 @@ int32_t cancel_translate(const idm_mapfile_entry *entry, const char *, idm_rule 
 }
 int32_t cancel_cleanup(idm_rule *rule, idm_id *) {
     if (rule != nullptr && g_block_at.load() == 2) block_here();
+    if (rule == nullptr && g_block_at.load() == 3) block_here();
     return 0;
 }
 
@@ -237,6 +239,7 @@ TEST_F(MappingThreads, CancelledInsideTheMpmLeavesNoMutexLocked) {
         {"translator, entry not cached", 1, false},
         {"translator, cached rule", 1, false},
         {"cleanup of a cached rule during the refresh", 2, true},
+        {"cleanup of the id after the match, the name already copied", 3, false},
     };
     int64_t mtime = kOld;
     for (const Case &c : cases) {
@@ -263,6 +266,7 @@ TEST_F(MappingThreads, CancelledInsideTheMpmLeavesNoMutexLocked) {
         EXPECT_EQ(sec_idm_map_identity("canc", "joe", &local), 0);
         EXPECT_STREQ(local.value, "local");
         std::free(local.value);
+        EXPECT_TRUE(sweep::no_leaks());
     }
 }
 
