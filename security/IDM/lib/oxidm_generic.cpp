@@ -65,7 +65,12 @@ __attribute__((visibility("default"))) int32_t sec_idm_map_identity(const char *
     } else {
         local->length = 0;
         local->value = nullptr;
+        MappingHold result(local);
         status = idm__state.services[type - 1].map_identity(mnemonic, network_id, local);
+        const int32_t word0 = service_word(type, 0);
+        const int32_t left = api.leave(status, trace::i32(word0));
+        result.keep();
+        return left;
     }
     const int32_t word0 = service_word(type, 0);
     return api.leave(status, trace::i32(word0));

@@ -186,6 +186,30 @@ class NoCancel {
     int old_ = PTHREAD_CANCEL_ENABLE;
 };
 
+// The local name a match puts in the caller's buffer, until the call
+// returns: a thread cancelled after the match (in the plug-in's cleanup
+// routine, or in a trace point on the way out) never hands the name to its
+// caller, so the name is released (zeroed) here.  Only a name written after
+// the hold was taken is released.
+class MappingHold {
+  public:
+    explicit MappingHold(idm_buffer *b) : b_(b), before_(b->value) {}
+    ~MappingHold() {
+        if (b_ == nullptr || b_->value == before_) return;
+        forget_dead_frames();
+        free_secret(b_->value);
+        b_->value = nullptr;
+        b_->length = 0;
+    }
+    void keep() { b_ = nullptr; }
+    MappingHold(const MappingHold &) = delete;
+    MappingHold &operator=(const MappingHold &) = delete;
+
+  private:
+    idm_buffer *b_;
+    char *before_;
+};
+
 // Holds a POSIX mutex; the destructor is the cancellation clean-up.
 class MutexHold {
   public:

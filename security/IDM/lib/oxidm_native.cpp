@@ -115,28 +115,6 @@ struct idm_entry_list_release {
     ~idm_entry_list_release() { idm__native_release_entry_list(count, entries); }
 };
 
-// The local name a match puts in the caller's buffer, until the call
-// returns: a thread cancelled after the match (in the plug-in's cleanup
-// routine) never hands the name to its caller, so the name is released here.
-class MappingHold {
-  public:
-    explicit MappingHold(idm_buffer *b) : b_(b), before_(b->value) {}
-    ~MappingHold() {
-        if (b_ == nullptr || b_->value == before_) return;
-        idm::forget_dead_frames();
-        idm::free_secret(b_->value);
-        b_->value = nullptr;
-        b_->length = 0;
-    }
-    void keep() { b_ = nullptr; }
-    MappingHold(const MappingHold &) = delete;
-    MappingHold &operator=(const MappingHold &) = delete;
-
-  private:
-    idm_buffer *b_;
-    char *before_;
-};
-
 // Maps `network_id` of mechanism `mnemonic` to a local user in `local`
 // (cleared by the caller; written only by a matching rule).  Returns
 //   0   the first matching entry's local name in `local` (the caller frees
