@@ -62,6 +62,12 @@ int lock_op(int fd, short type, bool wait) {
 
 }  // namespace
 
+// A path that names anything but a regular file (a FIFO, a device, a
+// directory, a socket, a symbolic link to one of those or to nothing) is
+// refused with 22: opening without O_NONBLOCK would wait for a FIFO's
+// writer, and reading a device or a directory never ends or fails.  The
+// descriptor is opened without blocking, examined, and only then switched
+// back to blocking reads.
 extern "C" int sec__open_file(const char *path, int flags, int *fd) {
     (void)flags;
     if (!path || !fd) return 23;
@@ -69,16 +75,24 @@ extern "C" int sec__open_file(const char *path, int flags, int *fd) {
         std::lock_guard<std::mutex> lock(g_mutex);
         if (int r = forced(*g_open_path, g_open_any, g_open_result, path)) return r;
     }
-    int d = open(path, O_RDONLY | O_CLOEXEC);
+    int d = open(path, O_RDONLY | O_CLOEXEC | O_NONBLOCK | O_NOCTTY);
     if (d < 0) {
+        struct stat link;
         switch (errno) {
         case EACCES:
         case EPERM: return 12;
-        case ENOENT:
+        case ENOENT: return lstat(path, &link) == 0 ? 22 : 21;  // a dangling link exists
         case ENOTDIR: return 21;
+        case ENXIO:   // a socket, or a device without its driver
+        case ELOOP: return 22;
         case ENOMEM: return 6;
         default: return 23;
         }
+    }
+    struct stat st;
+    if (fstat(d, &st) != 0 || !S_ISREG(st.st_mode) || fcntl(d, F_SETFL, 0) != 0) {
+        close(d);
+        return 22;
     }
     *fd = d;
     return 0;
@@ -115,11 +129,21 @@ extern "C" int sec__time_file(const char *path, uint32_t *mtime) {
         std::lock_guard<std::mutex> lock(g_mutex);
         if (int r = forced(*g_time_path, g_time_any, g_time_result, path)) return r;
     }
+    // One lstat for the usual case of a plain file or none; a symbolic link
+    // costs a second look at its target.  A link to nothing counts as
+    // present with the link's own time, so that the caller goes on to open
+    // it and fails there instead of taking the file for absent.
     struct stat st;
-    if (stat(path, &st) != 0) {
+    if (lstat(path, &st) != 0) {
         if (errno == ENOENT || errno == ENOTDIR) return 21;
         if (errno == EACCES) return 12;
         return 23;
+    }
+    if (S_ISLNK(st.st_mode)) {
+        struct stat target;
+        if (stat(path, &target) == 0) st = target;
+        else if (errno == EACCES) return 12;
+        else if (errno != ENOENT) return 23;
     }
     *mtime = static_cast<uint32_t>(st.st_mtime);
     return 0;

@@ -16,8 +16,11 @@
 extern "C" {
 #endif
 
-/* Opens an existing file read-only (close-on-exec).  0 and *fd; 12 access
- * denied; 21 no such file; 6 out of memory; 23 any other failure. */
+/* Opens an existing regular file read-only (close-on-exec), without ever
+ * waiting on what is found at the path.  0 and *fd; 12 access denied; 21 no
+ * such file; 22 not a regular file (FIFO, device, directory, socket, or a
+ * symbolic link to one of them or to nothing); 6 out of memory; 23 any other
+ * failure. */
 int sec__open_file(const char *path, int flags, int *fd);
 /* Shared lock on the whole file, waiting a bounded time (default 5 s).
  * 0 locked; 30 not obtained in time; 23 other failure. */
@@ -26,8 +29,9 @@ int sec__readlock_file(int fd, const char *caller);
 int sec__unlock_file(int fd, const char *caller);
 /* Closes *fd and sets it to -1; 0, or 23. */
 int sec__close_file(int *fd);
-/* Modification time in whole seconds (low 32 bits).  0; 21 no such file;
- * 12 access denied; 23 other failure. */
+/* Modification time in whole seconds (low 32 bits), of the link's target.
+ * 0; 21 no such file; 12 access denied; 23 other failure.  A symbolic link
+ * to nothing is present (0, with the link's own time): opening it fails. */
 int sec__time_file(const char *path, uint32_t *mtime);
 
 /* ---- inspection interface of the stand-in ---- */

@@ -4,6 +4,7 @@
 // which the component reads without a lock (single bytes).
 #include "ox_tr.h"
 
+#include <atomic>
 #include <cstdarg>
 #include <cstdio>
 #include <cstdlib>
@@ -119,11 +120,18 @@ void write_record(const Record &r) {
     std::fflush(g_out);
 }
 
+std::atomic<void (*)(int)> g_hook{nullptr};
+
 void add(Record &&r) {
-    std::lock_guard<std::mutex> lock(g_mutex);
-    read_env();
-    write_record(r);
-    if (g_keep && g_records->size() < kMaxRecords) g_records->push_back(std::move(r));
+    const int id = r.id;
+    {
+        std::lock_guard<std::mutex> lock(g_mutex);
+        read_env();
+        write_record(r);
+        if (g_keep && g_records->size() < kMaxRecords) g_records->push_back(std::move(r));
+    }
+    // Outside the mutex: a test's hook may block, or be cancelled, here.
+    if (void (*hook)(int) = g_hook.load(std::memory_order_acquire)) hook(id);
 }
 
 }  // namespace
@@ -190,6 +198,8 @@ extern "C" int tr_record_strings_1(const char *component, int id, int count, ...
 }
 
 // ---- inspection ----
+extern "C" void trx_on_record(void (*hook)(int id)) { g_hook.store(hook, std::memory_order_release); }
+
 extern "C" void trx_set_level(const char *component, int category, unsigned char level) {
     if (!component || category < 0 || category >= 16) return;
     std::lock_guard<std::mutex> lock(g_mutex);

@@ -54,6 +54,10 @@ int trx_registrations(const char *component);   /* successful registrations */
 int trx_unregistrations(const char *component);
 /* Category names as registered, or NULL. */
 const char *trx_category_name(const char *component, int category);
+/* Calls `hook` with the id of every record, on the recording thread, after
+ * the record is kept; NULL removes it.  Tests block threads at a chosen
+ * trace point with it. */
+void trx_on_record(void (*hook)(int id));
 /* Writes all kept records in readable form to `path` ("-" for stdout). */
 int trx_dump(const char *path);
 

@@ -146,33 +146,36 @@ TEST_F(Cancel, DuringTheLockWait) {
     EXPECT_EQ(mssx_locks_held(), 0);
 }
 
-// The local file is a FIFO: the pass parses what was written, then blocks
-// reading for more, holding the shared lock, and is cancelled there.
+// The pass is held inside the parse of the local file, after 25 entries and
+// with the shared lock taken, by the trace point of the 26th line, and is
+// cancelled there.
+std::atomic<int> g_lines_seen{0};
+void block_at_line_26(int id) {
+    if (id == 43 && g_lines_seen.fetch_add(1) == 25)
+        for (;;) pause();  // a cancellation point
+}
+
 TEST_F(Cancel, WhileParsingAFile) {
     OXTEST_REQUIRE_NAMESPACE();
-    ASSERT_EQ(mkfifo(kLocalMap, 0600), 0);
-    int writer = open(kLocalMap, O_RDWR | O_CLOEXEC);
-    ASSERT_GE(writer, 0);
     std::string lines;
-    for (int i = 0; i < 25; ++i) lines += "mechA:u" + std::to_string(i) + "=l" + std::to_string(i) + "\n";
-    ASSERT_EQ(write(writer, lines.data(), lines.size()), static_cast<ssize_t>(lines.size()));
+    for (int i = 0; i < 26; ++i) lines += "mechA:u" + std::to_string(i) + "=l" + std::to_string(i) + "\n";
+    oxtest::write_file(kLocalMap, lines, 1000);
     const int descriptors = open_descriptors();
     g_identifiers_freed.store(0);
     idm_test_on_secret_free(count_freed);
     oxtest::set_trace_levels(0, 0, 0, 0, 1);
+    g_lines_seen.store(0);
+    trx_on_record(block_at_line_26);
 
     Pass pass;
     pthread_t thread;
     ASSERT_EQ(pthread_create(&thread, nullptr, run_pass, &pass), 0);
-    // Everything written has been read once the pipe is empty.
-    wait_until([&] {
-        int pending = -1;
-        return mssx_locks_held() == 1 && ioctl(writer, FIONREAD, &pending) == 0 && pending == 0;
-    });
-    std::this_thread::sleep_for(std::chrono::milliseconds(50));
+    wait_until([&] { return g_lines_seen.load() > 25; });
+    ASSERT_EQ(mssx_locks_held(), 1);
     ASSERT_EQ(pthread_cancel(thread), 0);
     void *result = nullptr;
     ASSERT_EQ(pthread_join(thread, &result), 0);
+    trx_on_record(nullptr);
     EXPECT_EQ(result, PTHREAD_CANCELED);
     idm_test_on_secret_free(nullptr);
 
@@ -186,9 +189,7 @@ TEST_F(Cancel, WhileParsingAFile) {
         if (r.id == 87) released = r.text(0) == kLocalMap;
     EXPECT_TRUE(released) << "no clean-up record for the open file";
 
-    close(writer);
-    oxtest::remove_file(kLocalMap);
-    oxtest::write_file(kLocalMap, "mechA:a=b\n", 1000);
+    oxtest::write_file(kLocalMap, "mechA:a=b\n", 1001);
     ASSERT_EQ(pass.read(), 0);
     EXPECT_EQ(pass.count, 1);
 }

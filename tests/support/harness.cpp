@@ -20,8 +20,10 @@ void write_file(const std::string &path, const std::string &content, int64_t mti
         std::ofstream out(tmp, std::ios::binary | std::ios::trunc);
         out.write(content.data(), static_cast<std::streamsize>(content.size()));
     }
+    // The file gets its time before it takes the path, as a careful writer
+    // does: a reader never sees the new version change under it.
+    if (mtime >= 0) set_mtime(tmp, mtime);
     if (std::rename(tmp.c_str(), path.c_str()) != 0) ADD_FAILURE() << "cannot write " << path;
-    if (mtime >= 0) set_mtime(path, mtime);
 }
 
 void set_mtime(const std::string &path, int64_t mtime) {

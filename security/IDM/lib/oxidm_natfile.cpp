@@ -23,6 +23,7 @@
 
 #include <malloc.h>
 #include <stdio_ext.h>
+#include <sys/stat.h>
 
 #include <climits>
 
@@ -66,6 +67,54 @@ int32_t bad_param(int32_t status, const char *function, int trace_id, int32_t po
 }
 
 uintptr_t addr(const void *p) { return reinterpret_cast<uintptr_t>(p); }
+
+// The result code, in the 2650-655 report of a failed open, of a map file
+// path that names anything but a regular file; libox_mss uses the same.
+constexpr int kNotRegularFile = 22;
+// The code in the 2650-655 report of a file that kept changing while it was
+// read (EAGAIN).
+constexpr int kKeptChanging = 11;
+// How many times a file caught being written is read before the pass fails.
+constexpr int kReadAttempts = 3;
+
+// What the reading pass learns of one file beyond the status.
+struct FileOutcome {
+    bool held_back = false;   // a cut last line was not acted on
+    bool unreadable = false;  // not a regular file, a read error, or kept changing
+};
+
+bool is_regular_file(int fd) {
+    struct stat st;
+    return fstat(fd, &st) == 0 && S_ISREG(st.st_mode);
+}
+
+// What a reading pass compares before and after a file is parsed: a writer
+// that changed the file in between moves its size or modification time.
+struct FileStamp {
+    off_t size = -1;
+    struct timespec mtime {};
+    bool operator==(const FileStamp &o) const {
+        return size == o.size && mtime.tv_sec == o.mtime.tv_sec && mtime.tv_nsec == o.mtime.tv_nsec;
+    }
+};
+
+FileStamp stamp_of(int fd) {
+    FileStamp stamp;
+    struct stat st;
+    if (fstat(fd, &st) == 0) {
+        stamp.size = st.st_size;
+        stamp.mtime = st.st_mtim;
+    }
+    return stamp;
+}
+
+// A file last changed in this second or the one before may still be being
+// written: its unterminated last line is a cut line.
+bool changed_lately(const FileStamp &stamp) {
+    struct timeval now {};
+    cu_gettimeofday_1(&now, nullptr);
+    return stamp.size >= 0 && stamp.mtime.tv_sec >= now.tv_sec - 1;
+}
 
 // ---------------------------------------------------------------------------
 // Holds; each destructor is one of the named cancellation clean-ups
@@ -374,7 +423,13 @@ void idm__thread_cleanup_cachef(void *set) {
 // One file: opening, reading, one line, the entry array
 // ---------------------------------------------------------------------------
 
-int32_t idm__ready_mapfile(const char *path, int32_t *fd, FILE **stream) {
+}  // extern "C"
+
+namespace {
+
+// idm__ready_mapfile; the reading pass learns from `outcome` that the path
+// names no regular file.
+int32_t ready_mapfile(const char *path, int32_t *fd, FILE **stream, FileOutcome *outcome) {
     static constexpr trace::ApiIds kIds{24, 26, 27, 29};
     static constexpr const char kName[] = "idm__ready_mapfile";
     trace::Api api(kIds, trace::text(path, "[null]"), trace::ptr(fd), trace::ptr(stream));
@@ -401,6 +456,13 @@ int32_t idm__ready_mapfile(const char *path, int32_t *fd, FILE **stream) {
         r = sec__open_file(path, 0, &d);
         if (r == 0) hold.own(d);
     }
+    // Whatever the platform library checked, nothing but a regular file is
+    // read: a FIFO or a device handed over here would block or never end.
+    if (r == 0 && !is_regular_file(d)) {
+        hold.close();
+        r = kNotRegularFile;
+    }
+    if (r == kNotRegularFile && outcome != nullptr) outcome->unreadable = true;
     if (trace::diag_on()) trace::record_data(30, trace::text(path), trace::i32(r), trace::i32(d));
     switch (r) {
     case 0: break;
@@ -439,8 +501,32 @@ int32_t idm__ready_mapfile(const char *path, int32_t *fd, FILE **stream) {
     return leave(0);
 }
 
-int32_t idm__parse_mapfile(const char *mechanism, const char *path, FILE *stream, int32_t *count,
-                           idm_mapfile_entry **entries) {
+}  // namespace
+
+extern "C" {
+
+int32_t idm__ready_mapfile(const char *path, int32_t *fd, FILE **stream) {
+    return ready_mapfile(path, fd, stream, nullptr);
+}
+
+}  // extern "C"
+
+namespace {
+
+// True when nothing follows in `stream` (or it cannot be read further).
+bool at_end(FILE *stream) {
+    int c = getc_unlocked(stream);
+    if (c == EOF) return true;
+    ungetc(c, stream);
+    return false;
+}
+
+// idm__parse_mapfile.  For the reading pass (`outcome` not null) a file that
+// may still be being written keeps its unterminated last line back, since
+// it may be cut short, and the outcome says so; a direct call reads the
+// stream whole as it stands.
+int32_t parse_mapfile(const char *mechanism, const char *path, FILE *stream, int32_t *count,
+                      idm_mapfile_entry **entries, FileOutcome *outcome) {
     static constexpr trace::ApiIds kIds{36, 38, 39, 40};
     static constexpr const char kName[] = "idm__parse_mapfile";
     int32_t count_now = count != nullptr ? *count : 0;
@@ -457,13 +543,29 @@ int32_t idm__parse_mapfile(const char *mechanism, const char *path, FILE *stream
 
     if (trace::diag_on()) trace::record_data(42, trace::text(path), trace::text(mechanism));
     const std::string_view selector(mechanism);
+    const bool hold_cut_line = outcome != nullptr && changed_lately(stamp_of(fileno(stream)));
     int32_t status = 0;
+    int read_error = 0;
     char piece[1024];
-    while (std::fgets(piece, sizeof piece, stream) != nullptr) {
+    for (;;) {
+        errno = 0;
+        if (std::fgets(piece, sizeof piece, stream) == nullptr) {
+            if (std::ferror(stream)) read_error = errno != 0 ? errno : EIO;
+            break;
+        }
         if (trace::diag_on()) trace::record_data(43, trace::text(piece));
         // The piece as a C string: whatever follows a NUL byte is not seen.
         size_t n = std::strlen(piece);
-        if (n > 0 && piece[n - 1] == '\n') piece[--n] = '\0';
+        if (n > 0 && piece[n - 1] == '\n') {
+            piece[--n] = '\0';
+        } else if (hold_cut_line && at_end(stream)) {
+            if (std::ferror(stream)) {
+                read_error = errno != 0 ? errno : EIO;
+            } else {
+                outcome->held_back = true;
+            }
+            break;
+        }
         if (n == 0) {
             if (trace::diag_on()) trace::record_id(44);
             continue;
@@ -482,9 +584,25 @@ int32_t idm__parse_mapfile(const char *mechanism, const char *path, FILE *stream
         if (status != 0) break;
     }
     explicit_bzero(piece, sizeof piece);  // the last line read
+    // A read error is no end of file: the file's remaining lines, denials
+    // among them, were never seen, so the whole pass fails.
+    if (status == 0 && read_error != 0) {
+        if (outcome != nullptr) outcome->unreadable = true;
+        status = report(23, kMsg655, "fgets", read_error, kName);
+    }
     if (trace::diag_on()) trace::record_id(46);
     return leave(status);
 }
+
+}  // namespace
+
+extern "C" {
+
+int32_t idm__parse_mapfile(const char *mechanism, const char *path, FILE *stream, int32_t *count,
+                           idm_mapfile_entry **entries) {
+    return parse_mapfile(mechanism, path, stream, count, entries, nullptr);
+}
+
 
 int32_t idm__test_entry_mech(const char *mechanism, const char *line) {
     if (mechanism == nullptr || line == nullptr) return 1;
@@ -774,6 +892,62 @@ int32_t idm__native_test_mapfiles(idm_mapfile_set *set) {
 // Reading pass
 // ---------------------------------------------------------------------------
 
+}  // extern "C"
+
+namespace {
+
+// Drops the entries from index `from` on (zeroed and freed), leaving the
+// slots zeroed for the list to grow into again.
+void truncate_list(idm_entry_list &list, int32_t from) {
+    if (list.entries == nullptr || list.count <= from) return;
+    for (int32_t k = from; k < list.count; ++k) {
+        free_secret(list.entries[k].network_id);
+        free_secret(list.entries[k].local_id);
+        list.entries[k] = idm_mapfile_entry{};
+    }
+    list.count = from;
+}
+
+// Opens, parses and closes one file of a reading pass, appending its entries
+// to `list`.  A file whose size or modification time moved while it was
+// parsed was caught being written: its entries are dropped and it is read
+// again, a few times, before the pass fails closed with 2650-655.
+int32_t read_one_file(const char *mechanism, const char *path, idm_entry_list &list, FileOutcome &outcome) {
+    static constexpr const char kName[] = "idm__native_read_mapfiles";
+    for (int attempt = 1;; ++attempt) {
+        const int32_t first_entry = list.count;
+        MapfileHold hold(path);
+        idm_open_mapfile &open = hold.file();
+        outcome = FileOutcome{};
+        int32_t status = ready_mapfile(open.path, &open.fd, &open.stream, &outcome);
+        if (status != 0) return status;
+        hold.buffer_stream();
+        if (trace::diag_on()) trace::record_data(9, trace::text(open.path));
+        const FileStamp before = stamp_of(open.fd);
+        status = parse_mapfile(mechanism, open.path, open.stream, &list.count, &list.entries, &outcome);
+        const bool steady = stamp_of(open.fd) == before;
+        {
+            idm::NoCancel no_cancel;
+            sec__unlock_file(open.fd, kName);
+            FILE *stream = open.stream;
+            open.stream = nullptr;
+            open.fd = -1;
+            std::fclose(stream);
+        }
+        hold.disarm();
+        if (status != 0 || steady) return status;
+        truncate_list(list, first_entry);
+        if (attempt == kReadAttempts) {
+            outcome.unreadable = true;
+            return report(23, kMsg655, "idm__parse_mapfile", kKeptChanging, kName);
+        }
+    }
+}
+
+}  // namespace
+
+extern "C" {
+
 int32_t idm__native_read_mapfiles(const char *mechanism, idm_mapfile_set **set, int32_t *count,
                                   idm_mapfile_entry **entries) {
     static constexpr const char kName[] = "idm__native_read_mapfiles";
@@ -812,26 +986,21 @@ int32_t idm__native_read_mapfiles(const char *mechanism, idm_mapfile_set **set, 
     idm_entry_list &list = building.list();
     for (int32_t i = 0; i < files->count; ++i) {
         if ((files->flags[i] & MF_IN_USE) == 0) continue;
-        MapfileHold hold(files->names[i]);
-        idm_open_mapfile &open = hold.file();
-        int32_t status = idm__ready_mapfile(open.path, &open.fd, &open.stream);
-        if (status == 0) {
-            hold.buffer_stream();
-            if (trace::diag_on()) trace::record_data(9, trace::text(open.path));
-            status = idm__parse_mapfile(mechanism, open.path, open.stream, &list.count, &list.entries);
-            idm::NoCancel no_cancel;
-            sec__unlock_file(open.fd, kName);
-            FILE *stream = open.stream;
-            open.stream = nullptr;
-            open.fd = -1;
-            std::fclose(stream);
+        FileOutcome outcome;
+        int32_t status = read_one_file(mechanism, files->names[i], list, outcome);
+        // A file that could not be read whole, or whose cut last line was
+        // held back, is read again at the next request: its read time is
+        // set to its modification time, which the change test takes for a
+        // parse in the second of the change.  A failure to open or parse an
+        // ordinary file waits for a change, as before.
+        const bool again = outcome.unreadable || outcome.held_back;
+        if (status != 0) {
+            if (again) files->read_times[i] = files->mtimes[i];
+            return leave(status);  // the hold of the list frees it
         }
-        hold.disarm();
-        if (status != 0) return leave(status);  // the hold of the list frees it
-
         struct timeval now {};
         cu_gettimeofday_1(&now, nullptr);
-        files->read_times[i] = static_cast<uint32_t>(now.tv_sec);
+        files->read_times[i] = again ? files->mtimes[i] : static_cast<uint32_t>(now.tv_sec);
         files->flags[i] &= ~MF_REREAD;
     }
 
