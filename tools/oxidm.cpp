@@ -184,6 +184,23 @@ int cmd_groups(Context &ctx, const Args &in) {
 
 // ---- cluster ----
 
+// Trace point of the node file's load step, with the load's status.
+constexpr int kLoadEndPoint = 173;
+
+// True when a load step recorded since record `from` ended with a failure.
+bool load_failed_since(size_t from) {
+    for (size_t i = trx_count(); i-- > from;) {
+        int id = 0, kind = 0, items = 0;
+        if (trx_record(i, &id, &kind, &items) != 0 || id != kLoadEndPoint || items < 1) continue;
+        size_t length = 0;
+        const void *item = trx_item(i, 0, &length);
+        int32_t status = 0;
+        if (item != nullptr && length == sizeof status) std::memcpy(&status, item, sizeof status);
+        return status != 0;
+    }
+    return false;
+}
+
 int cmd_cluster(Context &ctx, const Args &in) {
     if (wants_help(in)) {
         std::fputs(kClusterHelp, stdout);
@@ -202,6 +219,9 @@ int cmd_cluster(Context &ctx, const Args &in) {
         active_known = cu_get_cluster_info_1(&info) == 0;
         if (active_known) active_name.assign(info.cluster_name, strnlen(info.cluster_name, sizeof info.cluster_name));
     }
+    // The load step's trace points (154, 173) are written at any API level
+    // but 0; level 2 writes no others.
+    if ((ctx.tracing ? ctx.trace_levels.level[1] : 0) == 0) trx_set_level("_SEI", 1, 2);
     int worst = kExitAnswer;
     Json json;
     json.begin_object().str("query", args[0]);
@@ -213,8 +233,12 @@ int cmd_cluster(Context &ctx, const Args &in) {
     for (size_t i = 1; i < args.size(); ++i) {
         const std::string &host = args[i];
         clear_library_error();
+        const size_t records_before = trx_count();
         int32_t answer = active ? sec_is_in_active_cluster(host.c_str()) : sec_is_in_any_cluster(host.c_str());
-        std::string error = answer == -1 ? library_error() : "";
+        // A load that succeeds leaves a 2650-690 behind (the end of each
+        // value list), so the pending error alone does not tell "not listed"
+        // from a failed load: the load's own trace point gives its status.
+        std::string error = answer == -1 && load_failed_since(records_before) ? library_error() : "";
         std::string meaning;
         int exit = kExitAnswer;
         if (answer == 1) {

@@ -42,6 +42,9 @@ Error last_error();
 ::testing::AssertionResult reported(int status, int msgno, const std::vector<std::string> &inserts);
 // No cu_set_error_1 call since the last clear_errors().
 ::testing::AssertionResult nothing_reported();
+// Nothing reported but the 2650-690 that a node file load leaves behind at
+// the end of every blank-separated value list.
+::testing::AssertionResult nothing_but_list_ends();
 void clear_errors();
 // Number of cu_set_error_1 calls on this thread since the last clear_errors().
 unsigned long reports_since_clear();

@@ -24,6 +24,7 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cctype>
 #include <memory>
 
@@ -53,8 +54,39 @@ constexpr int32_t kListStep = 32;  // working lists start with and grow by 32 en
 // time, so the next query loads again.
 constexpr int64_t kForceReload = INT64_MIN;
 
-int64_t load_lastmod() { return __atomic_load_n(&lastmod, __ATOMIC_RELAXED); }
-void store_lastmod(int64_t t) { __atomic_store_n(&lastmod, t, __ATOMIC_RELAXED); }
+int64_t load_lastmod() { return __atomic_load_n(&lastmod, __ATOMIC_ACQUIRE); }
+void store_lastmod(int64_t t) { __atomic_store_n(&lastmod, t, __ATOMIC_RELEASE); }
+
+// The time whose load has ended (whatever its outcome).  lastmod is claimed
+// by a load before it reads the file; a query that finds its file's time
+// claimed but not yet loaded waits for that load instead of answering from
+// trees the load has not rebuilt.  Written under g_outcome_mutex, with a
+// broadcast of g_outcome; read atomically without it.
+int64_t loadedmod = 0;
+pthread_mutex_t g_outcome_mutex = PTHREAD_MUTEX_INITIALIZER;
+pthread_cond_t g_outcome = PTHREAD_COND_INITIALIZER;
+
+int64_t load_loadedmod() { return __atomic_load_n(&loadedmod, __ATOMIC_ACQUIRE); }
+
+class OutcomeLock {
+  public:
+    OutcomeLock() { pthread_mutex_lock(&g_outcome_mutex); }
+    ~OutcomeLock() { pthread_mutex_unlock(&g_outcome_mutex); }
+    OutcomeLock(const OutcomeLock &) = delete;
+    OutcomeLock &operator=(const OutcomeLock &) = delete;
+};
+
+// The load that claimed `t` has ended.  A later claim (another time, or a
+// forced reload) keeps its waiters waiting for its own outcome.
+void finish_load(int64_t t) {
+    OutcomeLock lock;
+    if (load_lastmod() == t) __atomic_store_n(&loadedmod, t, __ATOMIC_RELEASE);
+    pthread_cond_broadcast(&g_outcome);
+}
+
+// How many times a node file caught being written is read before the load
+// fails.
+constexpr int kReadAttempts = 3;
 
 // The isspace classification of the current locale, taken once per parse
 // rather than by a library call per character.
@@ -126,7 +158,7 @@ class OldTrees {
 // descriptor always reaches its hold.
 int open_uncancelled(const char *path) {
     NoCancel no_cancel;
-    return ::open(path, O_RDONLY | O_CLOEXEC);
+    return ::open(path, O_RDONLY | O_CLOEXEC | O_NONBLOCK | O_NOCTTY);
 }
 
 // The descriptor of the file being read; closed at the end of the scope.
@@ -156,7 +188,9 @@ class FileHold {
 class ReloadUnlessDone {
   public:
     ~ReloadUnlessDone() {
-        if (armed_) store_lastmod(kForceReload);
+        if (!armed_) return;
+        store_lastmod(kForceReload);
+        announce_load_outcome();
     }
     void done() { armed_ = false; }
 
@@ -272,7 +306,10 @@ ParseResult parse(std::string_view text, const ParseSink &sink) {
         for (;;) {
             ++p;  // past the ":" or the blank that ended the previous value
             ValueScan v = scan_value(text.substr(p), ' ', is_space);
-            if (v.status != 0) break;
+            if (v.status != 0) {
+                if (sink.list_end != nullptr) sink.list_end(sink.context);
+                break;
+            }
             if (v.length != 0) {
                 if (int32_t s = sink.value(sink.context, rule.attr, text.substr(p + v.begin, v.length))) return s;
                 ++n;
@@ -402,9 +439,13 @@ class Builder {
         }
     }
 
-    ParseSink sink() { return {this, &Builder::on_value, &Builder::on_record}; }
+    ParseSink sink() { return {this, &Builder::on_value, &Builder::on_record, &Builder::on_list_end}; }
 
   private:
+    // The value extraction reports the end of a blank-separated list as an
+    // invalid entry; the parse takes it for the list's end, so a load that
+    // succeeds leaves this report behind as the current error.
+    static void on_list_end(void *) { report(21, kMsg690); }
     static int32_t on_value(void *self, Attr attr, std::string_view value) {
         return static_cast<Builder *>(self)->add_value(attr, value);
     }
@@ -517,45 +558,141 @@ bool is_address(const char *host) {
     return inet_pton(AF_INET, host, address) == 1 || inet_pton(AF_INET6, host, address) != 0;
 }
 
-// The reload rule; see read_clmap_file.
+// What a load compares before and after reading: a writer that changed the
+// file in between moved its size or modification time.
+struct FileStamp {
+    off_t size = -1;
+    struct timespec mtime {};
+    bool operator==(const FileStamp &o) const {
+        return size == o.size && mtime.tv_sec == o.mtime.tv_sec && mtime.tv_nsec == o.mtime.tv_nsec;
+    }
+};
+
+bool stamp_regular_file(int fd, FileStamp &stamp) {
+    struct stat st;
+    if (fstat(fd, &st) != 0 || !S_ISREG(st.st_mode)) return false;
+    stamp.size = st.st_size;
+    stamp.mtime = st.st_mtim;
+    return true;
+}
+
+// The node file's text, read to its end, with an LF appended.
+struct Text {
+    std::unique_ptr<char, decltype(&std::free)> bytes{nullptr, &std::free};
+    size_t size = 0;  // bytes read, without the appended LF
+};
+
+// Reads the open file to its end into `text`.  0; 6 after 2650-654; 21
+// after 2650-694 (a read error).  `expected` (the size the descriptor
+// reported) sizes the buffer; a file that grew since is read whole anyway.
+int32_t read_whole(int fd, size_t expected, Text &text) {
+    size_t capacity = expected + 1;
+    text.bytes.reset(static_cast<char *>(xmalloc(capacity)));
+    if (text.bytes == nullptr) return report_no_memory("idm__read_clmap_file", capacity);
+    text.size = 0;
+    for (;;) {
+        // With the buffer full, a small read tells the end of the file from
+        // more text, so that a file of the expected size costs no growth.
+        char more[4096];
+        const bool full = text.size + 1 == capacity;
+        char *to = full ? more : text.bytes.get() + text.size;
+        const ssize_t got = ::read(fd, to, full ? sizeof more : capacity - 1 - text.size);
+        if (got == 0) break;
+        if (got < 0) {
+            if (errno == EINTR) continue;
+            return report(21, kMsg694);
+        }
+        if (full) {
+            const size_t bigger = std::max(capacity * 2, capacity + static_cast<size_t>(got));
+            char *p = static_cast<char *>(xrealloc(text.bytes.get(), bigger));
+            if (p == nullptr) return report_no_memory("idm__read_clmap_file", bigger);
+            (void)text.bytes.release();
+            text.bytes.reset(p);
+            capacity = bigger;
+            std::memcpy(p + text.size, more, static_cast<size_t>(got));
+        }
+        text.size += static_cast<size_t>(got);
+    }
+    text.bytes.get()[text.size] = '\n';
+    return 0;
+}
+
+// A file last changed in this second or the one before may still be being
+// written, and then an unterminated last line may be cut short.
+bool cut_line(const Text &text, const FileStamp &stamp) {
+    if (text.size == 0 || text.bytes.get()[text.size - 1] == '\n') return false;
+    struct timeval now {};
+    cu_gettimeofday_1(&now, nullptr);
+    return stamp.mtime.tv_sec >= now.tv_sec - 1;
+}
+
+// The reload rule; see read_clmap_file and the module header.
 int32_t load(MapHold &hold) {
     struct stat st;
-    if (::stat(kNodeInfoPath, &st) != 0) {
-        if (errno != ENOENT) return report(21, kMsg692);
-        empty_trees(hold);
-        return 0;
+    for (;;) {
+        if (::stat(kNodeInfoPath, &st) != 0) {
+            if (errno != ENOENT) return report(21, kMsg692);
+            empty_trees(hold);
+            return 0;
+        }
+        // Anything but a regular file (a FIFO, a device, a directory, a
+        // socket) is a file that cannot be read, reported at every query
+        // until it is replaced; it is never opened.
+        if (!S_ISREG(st.st_mode)) return report(21, kMsg693);
+        if (st.st_size == 0) {
+            empty_trees(hold);
+            if (st.st_mtime != load_lastmod()) {
+                store_lastmod(st.st_mtime);
+                finish_load(st.st_mtime);
+            }
+            return 0;
+        }
+        if (st.st_mtime != load_lastmod()) break;
+        if (load_loadedmod() == st.st_mtime) return 0;  // the trees are current
+        // Another thread claimed this time and is still loading: wait for
+        // its outcome without holding a share, then look again.
+        hold.wait_for_load(st.st_mtime);
     }
-    if (st.st_size == 0) {
-        empty_trees(hold);
-        if (st.st_mtime != load_lastmod()) store_lastmod(st.st_mtime);
-        return 0;
-    }
-    if (st.st_mtime == load_lastmod()) return 0;
-    // Stored before the file is opened: a failure below is not retried until
-    // the time changes again.
-    store_lastmod(st.st_mtime);
+    // Claimed before the file is opened: a failure below is not retried
+    // until the time changes again (except where said).
+    const int64_t claimed = st.st_mtime;
+    store_lastmod(claimed);
     ReloadUnlessDone reload;
-    FileHold file(open_uncancelled(kNodeInfoPath));
-    if (file.fd() < 0) {
+    auto fail_and_retry_later = [&](int32_t status) {
+        store_lastmod(kForceReload);
         reload.done();
-        return report(21, kMsg693);
-    }
-    const size_t size = static_cast<size_t>(st.st_size);
-    std::unique_ptr<char, decltype(&std::free)> text(static_cast<char *>(xmalloc(size + 1)), &std::free);
-    if (text == nullptr) {
+        announce_load_outcome();
+        return status;
+    };
+    Text text;
+    for (int attempt = 1;; ++attempt) {
+        FileHold file(open_uncancelled(kNodeInfoPath));
+        FileStamp before, after;
+        if (file.fd() < 0 || !stamp_regular_file(file.fd(), before)) {
+            file.close();
+            reload.done();
+            finish_load(claimed);
+            return report(21, kMsg693);
+        }
+        if (int32_t status = read_whole(file.fd(), static_cast<size_t>(before.size), text); status != 0) {
+            file.close();
+            reload.done();
+            finish_load(claimed);
+            return status;
+        }
+        const bool steady = stamp_regular_file(file.fd(), after) && after == before;
         file.close();
-        reload.done();
-        return report_no_memory("idm__read_clmap_file", size + 1);
+        if (steady) {
+            // A cut last line is not acted on: the trees stay as they were
+            // and the next query loads again.
+            if (cut_line(text, after)) return fail_and_retry_later(0);
+            break;
+        }
+        if (attempt == kReadAttempts) return fail_and_retry_later(report(21, kMsg694));
     }
-    const ssize_t got = ::read(file.fd(), text.get(), size);
-    file.close();
-    if (got < 0 || static_cast<size_t>(got) != size) {
-        reload.done();
-        return report(21, kMsg694);
-    }
-    text.get()[size] = '\n';
-    const int32_t status = idm__construct_clcfg(hold, text.get(), size + 1);
+    const int32_t status = idm__construct_clcfg(hold, text.bytes.get(), text.size + 1);
     reload.done();
+    finish_load(claimed);
     return status;
 }
 
@@ -578,10 +715,28 @@ void MapHold::promote() {
     mode_ = kWrite;
 }
 
+void MapHold::wait_for_load(int64_t t) {
+    mode_ = kNone;
+    sec__unlock_read(lock_);
+    {
+        OutcomeLock lock;
+        // A cancellation in the wait re-takes the mutex and unwinds through
+        // OutcomeLock, which releases it; nothing else is held here.
+        while (load_lastmod() == t && load_loadedmod() != t) pthread_cond_wait(&g_outcome, &g_outcome_mutex);
+    }
+    sec__lock_read(lock_);
+    mode_ = kRead;
+}
+
 void MapHold::demote() {
     mode_ = kNone;  // the write hold is given up before the wait
     sec__lock_demote(lock_);
     mode_ = kRead;
+}
+
+void announce_load_outcome() {
+    OutcomeLock lock;
+    pthread_cond_broadcast(&g_outcome);
 }
 
 }  // namespace idm::clmap

@@ -51,6 +51,9 @@ class MapHold {
     ~MapHold();
     void promote();
     void demote();
+    // Gives up the read share until the load that claimed time `t` has
+    // ended (or another claim replaced it), then takes a share again.
+    void wait_for_load(int64_t t);
     MapHold(const MapHold &) = delete;
     MapHold &operator=(const MapHold &) = delete;
 
@@ -92,6 +95,9 @@ struct ParseSink {
     void *context;
     int32_t (*value)(void *context, Attr attr, std::string_view value);
     int32_t (*record)(void *context);
+    // Optional: the blank-separated part of a value list met its line's end
+    // (once per attribute line, before its last value).
+    void (*list_end)(void *context) = nullptr;
 };
 
 // Outcome of a parse.  status 0: every record was handed over.  status 21:
@@ -112,6 +118,10 @@ ParseResult parse(std::string_view text, const ParseSink &sink);
 // A value of `length` bytes at `begin` as a zero-filled heap string, or
 // nullptr after reporting 2650-654 for idm__extract_attr_value.
 char *copy_value(const char *begin, size_t length);
+
+// Wakes the queries waiting for the outcome of a load (called when a load
+// ends in any way, cancellation included).
+void announce_load_outcome();
 
 }  // namespace idm::clmap
 
