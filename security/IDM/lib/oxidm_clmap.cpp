@@ -632,6 +632,9 @@ int32_t load(MapHold &hold) {
     for (;;) {
         if (::stat(kNodeInfoPath, &st) != 0) {
             if (errno != ENOENT) return report(21, kMsg692);
+            // A symbolic link to nothing is a file that cannot be read, not
+            // a missing one.
+            if (::lstat(kNodeInfoPath, &st) == 0) return report(21, kMsg693);
             empty_trees(hold);
             return 0;
         }
