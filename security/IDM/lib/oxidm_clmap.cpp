@@ -671,11 +671,16 @@ int32_t load(MapHold &hold) {
     for (int attempt = 1;; ++attempt) {
         FileHold file(open_uncancelled(kNodeInfoPath));
         FileStamp before, after;
-        if (file.fd() < 0 || !stamp_regular_file(file.fd(), before)) {
-            file.close();
+        if (file.fd() < 0) {
             reload.done();
             finish_load(claimed);
             return report(21, kMsg693);
+        }
+        // Replaced by something else since the stat: the next query looks
+        // at the path again.
+        if (!stamp_regular_file(file.fd(), before)) {
+            file.close();
+            return fail_and_retry_later(report(21, kMsg693));
         }
         if (int32_t status = read_whole(file.fd(), static_cast<size_t>(before.size), text); status != 0) {
             file.close();
