@@ -12,6 +12,26 @@
 //                     by threads that hold only a read share
 //   idmutex           the reader-writer lock (oxsec_lock); the only lock of
 //                     this module, independent of the mapping locks
+//   loadedmod         (in the .cpp) the time whose load has ended; with
+//                     lastmod it tells a query that a load of its file's time
+//                     is still running.  Such a query gives up its share and
+//                     waits (a condition variable broadcast whenever a load
+//                     ends, cancelled loads included) instead of answering
+//                     from trees that load has not built yet
+//
+// Files in motion.  A path that stats as anything but a regular file (a
+// FIFO, a device, a directory, a socket, a symbolic link to one of them or
+// to nothing) is reported with 2650-693 at every query and never opened; the
+// open itself does not block, and the descriptor is checked again.  The file
+// is read to its end.  Its size and modification time are compared before
+// and after the read: a file that moved is read again, three times at most,
+// and then the load fails with 2650-694 and the next query loads again.  A
+// file last changed in the current or the previous second whose last line
+// has no line feed may be cut short: the load keeps the previous trees and
+// the next query loads again.  A writer that stops at a line feed for longer
+// than a load can still be caught with a shorter file (its last records
+// missing or incomplete); only a writer that replaces the file by rename is
+// safe from that.
 //
 // The judgement of the text is split from the file walk: parse() and
 // scan_value() are pure functions of a text (no trees, no reports, no

@@ -2,6 +2,31 @@
 // test remembers about each), the line format and its parser, and the
 // reading pass that rebuilds a mechanism's entry list when a file changed.
 //
+// Files in motion.  Only a regular file is read: a path that names a FIFO, a
+// device, a directory, a socket, or a symbolic link to one of them or to
+// nothing fails the pass (2650-655, status 23, result code 22), and the
+// descriptor libox_mss hands over is checked again, so that no platform
+// library can make a pass block or read for ever.  A read error fails the
+// pass too; it is never taken for the end of the file, whose remaining lines
+// (denials among them) would be lost.  A file caught being written is never
+// acted on half-written:
+//   - while a file's modification time is in the current or the previous
+//     second, an unterminated last line is held back (it may be cut short);
+//   - the file's size and modification time (fstat) are compared before and
+//     after it is parsed; a file that moved is parsed again, three times at
+//     most, and then the pass fails closed (2650-655, result code 11);
+//   - a file held back from, or failed in one of these ways, is read again at
+//     the next request (its read time is set to its modification time, which
+//     the change test takes for a parse in the second of the change).
+// What this cannot catch: a writer that rewrites a file in place and pauses
+// exactly at a line feed for longer than the parse leaves a shorter, valid
+// file.  Within one file a prefix can grant only what the whole file grants,
+// or less (the first match wins), but across files it can grant more: a
+// local file cut short loses denials that would have stopped a broad rule of
+// the global file.  Only a writer that replaces a file by rename, or holds
+// the write lock that readers take (an open-file-description lock), is safe
+// from that.  Files last changed earlier are read exactly as they stand.
+//
 // Nothing here takes a mutex.  A set, the list being built and the open
 // files of a pass are used by one thread at a time: the caller holds the
 // owning translator's mutex for the whole pass.  The only lock taken here is
