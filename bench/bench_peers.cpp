@@ -10,7 +10,9 @@
 //     ("RULE:[1:$1@$0](^user<i>@EXAMPLE\.ORG$)s/^.*$/local<i>/");
 //   - the grid-mapfile lookup globus_gss_assist_gridmap on a grid-mapfile
 //     (GRIDMAP) of the same identities as distinguished names
-//     ("/O=EXAMPLE.ORG/CN=user<i>" local<i>).
+//     ("/O=EXAMPLE.ORG/CN=user<i>" local<i>);
+//   - krb5_aname_to_localname through the oxidm local-authorization module
+//     (integrations/krb5) over libox_idm's map file, at 1,000 rules.
 // Every figure is checked once against the expected local name before it is
 // timed.  The peers are linked into this program only; the library does not
 // depend on them.
@@ -181,6 +183,36 @@ void BM_peer_krb5(benchmark::State &state) {
     state.counters["rules"] = rules;
 }
 
+#ifdef OXIDM_LOCALAUTH_MODULE
+// krb5_aname_to_localname answered by the oxidm local-authorization module
+// over the map file of idm_install (enable_only = oxidm: no RULE lines).
+void BM_peer_krb5_oxidm(benchmark::State &state) {
+    const int rules = static_cast<int>(state.range(0));
+    const int position = static_cast<int>(state.range(1));
+    if (!idm_install(rules)) return state.SkipWithError("libox_idm set-up failed");
+    static krb5_context ctx = [] {
+        bench::install_file("/tmp/oxidm-bench-krb5-oxidm.conf",
+                            "[libdefaults]\n    default_realm = EXAMPLE.ORG\n[plugins]\n    localauth = {\n"
+                            "        module = oxidm:" OXIDM_LOCALAUTH_MODULE "\n        enable_only = oxidm\n    }\n");
+        setenv("KRB5_CONFIG", "/tmp/oxidm-bench-krb5-oxidm.conf", 1);
+        krb5_context c = nullptr;
+        return krb5_init_context(&c) == 0 ? c : nullptr;
+    }();
+    if (ctx == nullptr) return state.SkipWithError("krb5_init_context failed");
+    krb5_principal princ = nullptr;
+    if (krb5_parse_name(ctx, principal(wanted(rules, position)).c_str(), &princ) != 0)
+        return state.SkipWithError("krb5_parse_name failed");
+    char local[256];
+    if (krb5_aname_to_localname(ctx, princ, sizeof local, local) != 0 || expected_local(rules, position) != local) {
+        krb5_free_principal(ctx, princ);
+        return state.SkipWithError("krb5_aname_to_localname through oxidm gave another answer");
+    }
+    for (auto _ : state) benchmark::DoNotOptimize(krb5_aname_to_localname(ctx, princ, sizeof local, local));
+    krb5_free_principal(ctx, princ);
+    state.counters["rules"] = rules;
+}
+#endif
+
 // ---- grid-mapfile ----
 
 std::string distinguished_name(int i) { return "/O=EXAMPLE.ORG/CN=user" + n_text(i); }
@@ -252,6 +284,12 @@ int main(int argc, char **argv) {
                 ->UseManualTime();
             benchmark::RegisterBenchmark("BM_peer_krb5", BM_peer_krb5)->Args({rules, position})->ArgNames({"rules", "last"});
             benchmark::RegisterBenchmark("BM_peer_gridmap", BM_peer_gridmap)->Args({rules, position})->ArgNames({"rules", "last"});
+#ifdef OXIDM_LOCALAUTH_MODULE
+            if (rules == 1000)
+                benchmark::RegisterBenchmark("BM_peer_krb5_oxidm", BM_peer_krb5_oxidm)
+                    ->Args({rules, position})
+                    ->ArgNames({"rules", "last"});
+#endif
         }
     benchmark::Initialize(&argc, argv);
     benchmark::RunSpecifiedBenchmarks();
