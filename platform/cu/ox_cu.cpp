@@ -10,8 +10,11 @@
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
+#include <fcntl.h>
 #include <mutex>
 #include <pthread.h>
+#include <sys/stat.h>
+#include <unistd.h>
 #include <set>
 #include <unordered_map>
 #include <string>
@@ -261,10 +264,15 @@ extern "C" int cu_get_cluster_info_1(cu_cluster_info_t *info) {
         }
         if (overridden) return 1;
         // A short read of a small file, with cancellation off so that a
-        // cancelled caller does not leave the stream open.
+        // cancelled caller does not leave the stream open.  Only a regular
+        // file is read: the open does not wait for a FIFO's writer.
         int cancel_state;
         pthread_setcancelstate(PTHREAD_CANCEL_DISABLE, &cancel_state);
-        FILE *f = std::fopen(CU_ACTIVE_CLUSTER_FILE, "re");
+        FILE *f = nullptr;
+        int fd = open(CU_ACTIVE_CLUSTER_FILE, O_RDONLY | O_CLOEXEC | O_NONBLOCK | O_NOCTTY);
+        struct stat st;
+        if (fd >= 0 && fstat(fd, &st) == 0 && S_ISREG(st.st_mode)) f = fdopen(fd, "r");
+        if (f == nullptr && fd >= 0) close(fd);
         char line[256];
         bool got = f != nullptr && std::fgets(line, sizeof line, f) != nullptr;
         if (f) std::fclose(f);

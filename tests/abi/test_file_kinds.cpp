@@ -1,7 +1,7 @@
 // What stands at a configured path that is not a regular file, through the
 // shipped library: a mapping whose local map file is such a path, with a
-// global file that would grant anyone, and a cluster query whose node file
-// is one.  Each call runs in a child process under an alarm, so a call that
+// global file that would grant anyone, and cluster queries whose node file
+// and active cluster file are such paths.  Each call runs in a child process under an alarm, so a call that
 // blocks or spins fails its row instead of stalling the suite; none grants.
 #include <fcntl.h>
 #include <sys/socket.h>
@@ -24,6 +24,7 @@ constexpr int kMsg653 = 274;  // map file not accessible
 constexpr int kMsg655 = 276;  // internal failure (a file that cannot be read)
 constexpr int kMsg693 = 318;  // node file cannot be read
 constexpr uid_t kNobody = 65534;
+constexpr char kActiveCluster[] = "/var/ox/cfg/active_cluster";  // read by libox_cu
 
 enum Kind { kFifo, kDevice, kDirectory, kSocket, kLinkToFifo, kLinkToDevice, kLinkToDirectory, kLinkToSocket,
             kDanglingLink, kUnreadable };
@@ -88,7 +89,8 @@ void probe(void *arg) {
     cux_clear_error();
     if (p.node) {
         const int32_t answer = sec_is_in_any_cluster("hosta");
-        _exit(answer == -1 && cux_error_msgno() == p.row->node_msgno ? 0 : 1);
+        if (answer != -1 || cux_error_msgno() != p.row->node_msgno) _exit(1);
+        _exit(sec_is_in_active_cluster("hosta") == -1 ? 0 : 2);
     }
     idm_buffer local{};
     const int32_t status = sec_idm_map_identity("princ", "alice@EX", &local);
@@ -112,7 +114,8 @@ TEST_F(FileKinds, NoCallBlocksOrGrantsOnAPathThatIsNoRegularFile) {
         if (row.kind == kUnreadable && getuid() != 0) continue;  // needs a uid to drop to
         oxtest::fresh_config_dirs();
         oxtest::write_file(oxtest::kVarGlobalMap, "princ:*@EX=granted\n");
-        if (!make(row.kind, oxtest::kLocalMap) || !make(row.kind, oxtest::kNodeInfo)) {
+        if (!make(row.kind, oxtest::kLocalMap) || !make(row.kind, oxtest::kNodeInfo) ||
+            !make(row.kind, kActiveCluster)) {
             ADD_FAILURE() << "cannot make the file";
             continue;
         }
