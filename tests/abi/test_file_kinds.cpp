@@ -27,7 +27,7 @@ constexpr uid_t kNobody = 65534;
 constexpr char kActiveCluster[] = "/var/ox/cfg/active_cluster";  // read by libox_cu
 
 enum Kind { kFifo, kDevice, kDirectory, kSocket, kLinkToFifo, kLinkToDevice, kLinkToDirectory, kLinkToSocket,
-            kDanglingLink, kUnreadable };
+            kDanglingLink, kUnreadable, kReadError, kEndless };
 
 // Makes `path` the kind of thing a row names; false when this system cannot.
 bool make(Kind kind, const std::string &path) {
@@ -50,6 +50,8 @@ bool make(Kind kind, const std::string &path) {
     case kLinkToDirectory: return make(kDirectory, other) && symlink(other.c_str(), path.c_str()) == 0;
     case kLinkToSocket: return make(kSocket, other) && symlink(other.c_str(), path.c_str()) == 0;
     case kDanglingLink: return symlink(other.c_str(), path.c_str()) == 0;
+    case kReadError: return symlink("/proc/self/mem", path.c_str()) == 0;     // reads fail with EIO
+    case kEndless: return symlink("/proc/self/pagemap", path.c_str()) == 0;   // size 0, never ends
     case kUnreadable:
         oxtest::write_file(path, path == oxtest::kNodeInfo ? "NODE:\nNAME: hosta\nCLUSTER: c\n" : "princ:!*@EX\n");
         return chmod(path.c_str(), 0) == 0;
@@ -62,7 +64,7 @@ struct Row {
     Kind kind;
     int32_t map_status;  // the mapping's status (nothing granted)
     int map_msgno;
-    int node_msgno;      // the cluster query answers -1 with this report
+    int node_msgno;      // the cluster query answers -1 with this report (0: none)
 };
 constexpr Row kRows[] = {
     {"FIFO", kFifo, 23, kMsg655, kMsg693},
@@ -75,6 +77,9 @@ constexpr Row kRows[] = {
     {"link to a socket", kLinkToSocket, 23, kMsg655, kMsg693},
     {"link to nothing", kDanglingLink, 23, kMsg655, kMsg693},
     {"mode 000, caller not root", kUnreadable, 36, kMsg653, kMsg693},
+    // Kernel files: regular, of size 0, which the node file takes for empty.
+    {"a read error", kReadError, 23, kMsg655, 0},
+    {"a file that never ends", kEndless, 23, kMsg655, 0},
 };
 
 // Child: the call under a watchdog; exit 0 when the row's answer came back.

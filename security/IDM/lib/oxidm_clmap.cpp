@@ -585,7 +585,10 @@ struct Text {
 // Reads the open file to its end into `text`.  0; 6 after 2650-654; 21
 // after 2650-694 (a read error).  `expected` (the size the descriptor
 // reported) sizes the buffer; a file that grew since is read whole anyway.
-int32_t read_whole(int fd, size_t expected, Text &text) {
+int32_t read_whole(int fd, size_t expected, Text &text, bool &grew) {
+    // A file that grows while it is read is read on, to this many bytes.
+    const size_t limit = expected < SIZE_MAX / 4 ? expected * 2 + 65536 : expected;
+    grew = false;
     size_t capacity = expected + 1;
     text.bytes.reset(static_cast<char *>(xmalloc(capacity)));
     if (text.bytes == nullptr) return report_no_memory("idm__read_clmap_file", capacity);
@@ -603,6 +606,13 @@ int32_t read_whole(int fd, size_t expected, Text &text) {
             return report(21, kMsg694);
         }
         if (full) {
+            // More than its size at the open: the file grew, or it never
+            // ends (a kernel file that reports no size).  The caller judges
+            // by the stamps.
+            if (text.size >= limit) {
+                grew = true;
+                break;
+            }
             const size_t bigger = std::max(capacity * 2, capacity + static_cast<size_t>(got));
             char *p = static_cast<char *>(xrealloc(text.bytes.get(), bigger));
             if (p == nullptr) return report_no_memory("idm__read_clmap_file", bigger);
@@ -682,7 +692,8 @@ int32_t load(MapHold &hold) {
             file.close();
             return fail_and_retry_later(report(21, kMsg693));
         }
-        if (int32_t status = read_whole(file.fd(), static_cast<size_t>(before.size), text); status != 0) {
+        bool grew = false;
+        if (int32_t status = read_whole(file.fd(), static_cast<size_t>(before.size), text, grew); status != 0) {
             file.close();
             reload.done();
             finish_load(claimed);
@@ -690,6 +701,7 @@ int32_t load(MapHold &hold) {
         }
         const bool steady = stamp_regular_file(file.fd(), after) && after == before;
         file.close();
+        if (steady && grew) return fail_and_retry_later(report(21, kMsg694));
         if (steady) {
             // A cut last line is not acted on: the trees stay as they were
             // and the next query loads again.

@@ -81,6 +81,7 @@ constexpr int kReadAttempts = 3;
 struct FileOutcome {
     bool held_back = false;   // a cut last line was not acted on
     bool unreadable = false;  // not a regular file, a read error, or kept changing
+    bool overran = false;     // it gave more than its size at the start
 };
 
 bool is_regular_file(int fd) {
@@ -543,7 +544,13 @@ int32_t parse_mapfile(const char *mechanism, const char *path, FILE *stream, int
 
     if (trace::diag_on()) trace::record_data(42, trace::text(path), trace::text(mechanism));
     const std::string_view selector(mechanism);
-    const bool hold_cut_line = outcome != nullptr && changed_lately(stamp_of(fileno(stream)));
+    const FileStamp start = outcome != nullptr ? stamp_of(fileno(stream)) : FileStamp{};
+    const bool hold_cut_line = outcome != nullptr && changed_lately(start);
+    // Every piece takes at least one byte: more pieces than the file had
+    // bytes at the start means it grew, or never ends (a kernel file that
+    // reports no size); the pass stops there and judges by the stamps.
+    const int64_t piece_limit = start.size >= 0 ? static_cast<int64_t>(start.size) : INT64_MAX;
+    int64_t pieces = 0;
     int32_t status = 0;
     int read_error = 0;
     char piece[1024];
@@ -551,6 +558,10 @@ int32_t parse_mapfile(const char *mechanism, const char *path, FILE *stream, int
         errno = 0;
         if (std::fgets(piece, sizeof piece, stream) == nullptr) {
             if (std::ferror(stream)) read_error = errno != 0 ? errno : EIO;
+            break;
+        }
+        if (++pieces > piece_limit) {
+            outcome->overran = true;
             break;
         }
         if (trace::diag_on()) trace::record_data(43, trace::text(piece));
@@ -935,6 +946,12 @@ int32_t read_one_file(const char *mechanism, const char *path, idm_entry_list &l
             std::fclose(stream);
         }
         hold.disarm();
+        if (status == 0 && outcome.overran && steady) {
+            // More text than its unchanged size: no file a writer keeps.
+            truncate_list(list, first_entry);
+            outcome.unreadable = true;
+            return report(23, kMsg655, "idm__parse_mapfile", kNotRegularFile, kName);
+        }
         if (status != 0 || steady) return status;
         truncate_list(list, first_entry);
         if (attempt == kReadAttempts) {
