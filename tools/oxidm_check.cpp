@@ -40,8 +40,9 @@ size_t count_of(const Report &r, Severity s) {
                                              [s](const Finding &f) { return f.severity == s; }));
 }
 
-// Why the library found a selected line invalid (rules 6 and 7), for a line
-// with the comment already cut and no line feed.
+// Why the library found a selected line invalid (neither a denial nor an
+// affirmative mapping), for a line with the comment already cut and no line
+// feed.
 std::string invalid_reason(std::string_view line, bool comment_cut) {
     size_t colon = line.find(':');
     size_t p = colon + 1;

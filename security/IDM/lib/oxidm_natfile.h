@@ -164,11 +164,13 @@ struct LineVerdict {
     std::string_view local_id;  // empty for a denial
 };
 
-// Rule 5: after leading blanks, the text up to the first colon equals
-// `mechanism` exactly.
+// The mechanism selector: after leading blanks, the text up to the first
+// colon equals `mechanism` exactly (same length, case significant).
 bool selects(std::string_view mechanism, std::string_view line) noexcept;
-// Rules 6 and 7 for a line already selected (comment cut, no line feed):
-// kInvalid, kAffirmative or kDenial.
+// The rule of a line already selected (comment cut, no line feed): a denial
+// ("!" and a network identifier, no "=" anywhere) or an affirmative mapping
+// (a network identifier, "=", a local identifier); kInvalid when it fits
+// neither form.
 LineVerdict judge_rule(std::string_view line) noexcept;
 // The whole check of one piece as read from a file (at most one line feed,
 // at its end): line feed removal, comment cut, blank test, selector, rule.
