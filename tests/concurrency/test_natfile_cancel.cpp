@@ -210,7 +210,7 @@ TEST_F(Cancel, ParallelPassesSeeWholeVersions) {
     for (int t = 0; t < 3; ++t) {
         readers.emplace_back([&] {
             Pass pass;
-            for (int i = 0; i < 300 && !stop.load(); ++i) {
+            for (int i = 0; i < 300 && (i == 0 || !stop.load()); ++i) {
                 int32_t r = pass.read();
                 if (r != 0 && r != 1) continue;
                 passes.fetch_add(1);

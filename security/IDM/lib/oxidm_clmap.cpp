@@ -183,19 +183,34 @@ class FileHold {
     int fd_;
 };
 
-// Armed while a load has stored the new lastmod but not yet finished: if the
-// thread is cancelled meanwhile, the next query loads the file again.
-class ReloadUnlessDone {
+// A load's claim of a file time, stored in lastmod before the file is read.
+// It ends in one of two ways, and either wakes the queries waiting for it:
+// finished (the trees are as this load leaves them; the time is not loaded
+// again) or retried (lastmod no longer names a time, so the next query loads
+// the file again).  A cancelled load is retried.
+class LoadClaim {
   public:
-    ~ReloadUnlessDone() {
-        if (!armed_) return;
+    explicit LoadClaim(int64_t t) : time_(t) { store_lastmod(t); }
+    ~LoadClaim() {
+        if (open_) retry();
+    }
+    int32_t finish(int32_t status) {
+        open_ = false;
+        finish_load(time_);
+        return status;
+    }
+    int32_t retry(int32_t status = 0) {
+        open_ = false;
         store_lastmod(kForceReload);
         announce_load_outcome();
+        return status;
     }
-    void done() { armed_ = false; }
+    LoadClaim(const LoadClaim &) = delete;
+    LoadClaim &operator=(const LoadClaim &) = delete;
 
   private:
-    bool armed_ = true;
+    int64_t time_;
+    bool open_ = true;
 };
 
 // ---- the pure parser ----
@@ -666,54 +681,31 @@ int32_t load(MapHold &hold) {
         // its outcome without holding a share, then look again.
         hold.wait_for_load(st.st_mtime);
     }
-    // Claimed before the file is opened: a failure below is not retried
-    // until the time changes again (except where said).
-    const int64_t claimed = st.st_mtime;
-    store_lastmod(claimed);
-    ReloadUnlessDone reload;
-    auto fail_and_retry_later = [&](int32_t status) {
-        store_lastmod(kForceReload);
-        reload.done();
-        announce_load_outcome();
-        return status;
-    };
+    // Claimed before the file is opened: a failure to open or read it, or
+    // an invalid text, is not loaded again until the time changes; a file
+    // caught being written is.
+    LoadClaim claim(st.st_mtime);
     Text text;
     for (int attempt = 1;; ++attempt) {
         FileHold file(open_uncancelled(kNodeInfoPath));
+        if (file.fd() < 0) return claim.finish(report(21, kMsg693));
         FileStamp before, after;
-        if (file.fd() < 0) {
-            reload.done();
-            finish_load(claimed);
-            return report(21, kMsg693);
-        }
-        // Replaced by something else since the stat: the next query looks
-        // at the path again.
-        if (!stamp_regular_file(file.fd(), before)) {
-            file.close();
-            return fail_and_retry_later(report(21, kMsg693));
-        }
+        // Replaced by something else since the stat: looked at again.
+        if (!stamp_regular_file(file.fd(), before)) return claim.retry(report(21, kMsg693));
         bool grew = false;
-        if (int32_t status = read_whole(file.fd(), static_cast<size_t>(before.size), text, grew); status != 0) {
-            file.close();
-            reload.done();
-            finish_load(claimed);
-            return status;
-        }
+        if (int32_t status = read_whole(file.fd(), static_cast<size_t>(before.size), text, grew); status != 0)
+            return claim.finish(status);
         const bool steady = stamp_regular_file(file.fd(), after) && after == before;
         file.close();
-        if (steady && grew) return fail_and_retry_later(report(21, kMsg694));
+        if (steady && grew) return claim.retry(report(21, kMsg694));
         if (steady) {
-            // A cut last line is not acted on: the trees stay as they were
-            // and the next query loads again.
-            if (cut_line(text, after)) return fail_and_retry_later(0);
+            // A cut last line is not acted on: the trees stay as they were.
+            if (cut_line(text, after)) return claim.retry();
             break;
         }
-        if (attempt == kReadAttempts) return fail_and_retry_later(report(21, kMsg694));
+        if (attempt == kReadAttempts) return claim.retry(report(21, kMsg694));
     }
-    const int32_t status = idm__construct_clcfg(hold, text.bytes.get(), text.size + 1);
-    reload.done();
-    finish_load(claimed);
-    return status;
+    return claim.finish(idm__construct_clcfg(hold, text.bytes.get(), text.size + 1));
 }
 
 }  // namespace
