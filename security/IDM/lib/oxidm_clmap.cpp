@@ -573,24 +573,6 @@ bool is_address(const char *host) {
     return inet_pton(AF_INET, host, address) == 1 || inet_pton(AF_INET6, host, address) != 0;
 }
 
-// What a load compares before and after reading: a writer that changed the
-// file in between moved its size or modification time.
-struct FileStamp {
-    off_t size = -1;
-    struct timespec mtime {};
-    bool operator==(const FileStamp &o) const {
-        return size == o.size && mtime.tv_sec == o.mtime.tv_sec && mtime.tv_nsec == o.mtime.tv_nsec;
-    }
-};
-
-bool stamp_regular_file(int fd, FileStamp &stamp) {
-    struct stat st;
-    if (fstat(fd, &st) != 0 || !S_ISREG(st.st_mode)) return false;
-    stamp.size = st.st_size;
-    stamp.mtime = st.st_mtim;
-    return true;
-}
-
 // The node file's text, read to its end, with an LF appended.
 struct Text {
     std::unique_ptr<char, decltype(&std::free)> bytes{nullptr, &std::free};
@@ -689,13 +671,14 @@ int32_t load(MapHold &hold) {
     for (int attempt = 1;; ++attempt) {
         FileHold file(open_uncancelled(kNodeInfoPath));
         if (file.fd() < 0) return claim.finish(report(21, kMsg693));
-        FileStamp before, after;
+        const FileStamp before = stamp_of(file.fd());
         // Replaced by something else since the stat: looked at again.
-        if (!stamp_regular_file(file.fd(), before)) return claim.retry(report(21, kMsg693));
+        if (!before.regular) return claim.retry(report(21, kMsg693));
         bool grew = false;
         if (int32_t status = read_whole(file.fd(), static_cast<size_t>(before.size), text, grew); status != 0)
             return claim.finish(status);
-        const bool steady = stamp_regular_file(file.fd(), after) && after == before;
+        const FileStamp after = stamp_of(file.fd());
+        const bool steady = after == before;
         file.close();
         if (steady && grew) return claim.retry(report(21, kMsg694));
         if (steady) {

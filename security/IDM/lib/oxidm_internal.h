@@ -15,6 +15,7 @@
 #define OXIDM_INTERNAL_H
 
 #include <pthread.h>
+#include <sys/types.h>
 #include <strings.h>
 #if defined(__SANITIZE_ADDRESS__)
 #include <sanitizer/asan_interface.h>
@@ -25,6 +26,7 @@
 #include <cstdint>
 #include <cstdlib>
 #include <cstring>
+#include <ctime>
 
 #include "ox_cu.h"
 #include "ox_mss.h"
@@ -234,6 +236,20 @@ inline uint32_t native_word(int i) {
     return i == 0 ? __atomic_load_n(&idm__native_state.reserved, __ATOMIC_RELAXED)
                   : __atomic_load_n(&idm__native_state.translator_count, __ATOMIC_RELAXED);
 }
+
+// A file's size and modification time as fstat reports them on an open
+// descriptor (size -1 when fstat fails): what a reader compares before and
+// after reading, to tell a file that a writer changed meanwhile.
+struct FileStamp {
+    off_t size = -1;
+    struct timespec mtime {};
+    bool regular = false;
+    bool operator==(const FileStamp &o) const {
+        return size == o.size && regular == o.regular && mtime.tv_sec == o.mtime.tv_sec &&
+               mtime.tv_nsec == o.mtime.tv_nsec;
+    }
+};
+FileStamp stamp_of(int fd);
 
 }  // namespace idm
 

@@ -79,35 +79,11 @@ constexpr int kReadAttempts = 3;
 
 // What the reading pass learns of one file beyond the status.
 struct FileOutcome {
+    FileStamp start;          // the open file's size and time, before the parse
     bool held_back = false;   // a cut last line was not acted on
     bool unreadable = false;  // not a regular file, a read error, or kept changing
     bool overran = false;     // it gave more than its size at the start
 };
-
-bool is_regular_file(int fd) {
-    struct stat st;
-    return fstat(fd, &st) == 0 && S_ISREG(st.st_mode);
-}
-
-// What a reading pass compares before and after a file is parsed: a writer
-// that changed the file in between moves its size or modification time.
-struct FileStamp {
-    off_t size = -1;
-    struct timespec mtime {};
-    bool operator==(const FileStamp &o) const {
-        return size == o.size && mtime.tv_sec == o.mtime.tv_sec && mtime.tv_nsec == o.mtime.tv_nsec;
-    }
-};
-
-FileStamp stamp_of(int fd) {
-    FileStamp stamp;
-    struct stat st;
-    if (fstat(fd, &st) == 0) {
-        stamp.size = st.st_size;
-        stamp.mtime = st.st_mtim;
-    }
-    return stamp;
-}
 
 // A file last changed in this second or the one before may still be being
 // written: its unterminated last line is a cut line.
@@ -459,7 +435,7 @@ int32_t ready_mapfile(const char *path, int32_t *fd, FILE **stream, FileOutcome 
     }
     // Whatever the platform library checked, nothing but a regular file is
     // read: a FIFO or a device handed over here would block or never end.
-    if (r == 0 && !is_regular_file(d)) {
+    if (r == 0 && !stamp_of(d).regular) {
         hold.close();
         r = kNotRegularFile;
     }
@@ -544,7 +520,7 @@ int32_t parse_mapfile(const char *mechanism, const char *path, FILE *stream, int
 
     if (trace::diag_on()) trace::record_data(42, trace::text(path), trace::text(mechanism));
     const std::string_view selector(mechanism);
-    const FileStamp start = outcome != nullptr ? stamp_of(fileno(stream)) : FileStamp{};
+    const FileStamp start = outcome != nullptr ? outcome->start : FileStamp{};
     const bool hold_cut_line = outcome != nullptr && changed_lately(start);
     // Every piece takes at least one byte: more pieces than the file had
     // bytes at the start means it grew, or never ends (a kernel file that
@@ -613,7 +589,6 @@ int32_t idm__parse_mapfile(const char *mechanism, const char *path, FILE *stream
                            idm_mapfile_entry **entries) {
     return parse_mapfile(mechanism, path, stream, count, entries, nullptr);
 }
-
 
 int32_t idm__test_entry_mech(const char *mechanism, const char *line) {
     if (mechanism == nullptr || line == nullptr) return 1;
@@ -934,9 +909,9 @@ int32_t read_one_file(const char *mechanism, const char *path, idm_entry_list &l
         if (status != 0) return status;
         hold.buffer_stream();
         if (trace::diag_on()) trace::record_data(9, trace::text(open.path));
-        const FileStamp before = stamp_of(open.fd);
+        outcome.start = stamp_of(open.fd);
         status = parse_mapfile(mechanism, open.path, open.stream, &list.count, &list.entries, &outcome);
-        const bool steady = stamp_of(open.fd) == before;
+        const bool steady = stamp_of(open.fd) == outcome.start;
         {
             idm::NoCancel no_cancel;
             sec__unlock_file(open.fd, kName);

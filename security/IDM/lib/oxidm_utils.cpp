@@ -4,6 +4,8 @@
 // make the n-th allocation or a mutex initialisation fail.
 #include "oxidm_internal.h"
 
+#include <sys/stat.h>
+
 #include <atomic>
 
 namespace idm {
@@ -67,6 +69,17 @@ void fault_note_secret_free(const void *p, size_t n) {
     if (auto hook = g_secret_hook.load()) hook(p, n);
 }
 #endif
+
+FileStamp stamp_of(int fd) {
+    FileStamp stamp;
+    struct stat st;
+    if (fstat(fd, &st) == 0) {
+        stamp.size = st.st_size;
+        stamp.mtime = st.st_mtim;
+        stamp.regular = S_ISREG(st.st_mode);
+    }
+    return stamp;
+}
 
 }  // namespace idm
 
