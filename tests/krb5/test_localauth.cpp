@@ -1,6 +1,7 @@
 // The Kerberos local-authorization module through the real krb5 library:
 // krb5_aname_to_localname and krb5_kuserok under a krb5.conf that makes the
 // map files the only authority (enable_only = oxidm).  No KDC is needed.
+#include <dlfcn.h>
 #include <krb5/krb5.h>
 #include <sys/stat.h>
 
@@ -15,11 +16,16 @@ namespace {
 
 constexpr krb5_error_code kNoMapping = KRB5_LNAME_NOTRANS;
 
+// Loaded before the test enters its mount namespace, whose private /tmp may
+// hide the build tree: krb5's later dlopen of the same path finds it loaded.
+void *const g_module = dlopen(OXIDM_LOCALAUTH_MODULE, RTLD_NOW | RTLD_GLOBAL);
+
 class Krb5Bridge : public oxtest::Test {
   protected:
     void SetUp() override {
         oxtest::Test::SetUp();
         OXTEST_REQUIRE_NAMESPACE();
+        ASSERT_NE(g_module, nullptr) << dlerror();
         const std::string conf = std::string(oxtest::kVarCfg) + "/krb5.conf";
         oxtest::write_file(conf, "[libdefaults]\n  default_realm = EX.ORG\n"
                                  "[plugins]\n  localauth = {\n    module = oxidm:" OXIDM_LOCALAUTH_MODULE "\n"
