@@ -40,7 +40,10 @@ void mssx_set_lock_wait_ms(int ms);          /* bounded wait of sec__readlock_fi
 void mssx_force_open(const char *path, int result);
 void mssx_force_readlock(int result);
 void mssx_force_time(const char *path, int result);
-long mssx_locks_held(void);                  /* locks taken and not yet released */
+long mssx_locks_held(void);
+/* Non-zero: sec__open_file hands over any file that opens, unchecked, as a
+ * platform library that does not check would. */
+void mssx_accept_any_file(int on);                  /* locks taken and not yet released */
 void mssx_reset(void);
 
 #ifdef __cplusplus

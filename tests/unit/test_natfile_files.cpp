@@ -691,11 +691,14 @@ TEST_F(MapFiles, ReadFailureLeavesTheCallersListUntouched) {
     EXPECT_EQ(pass.entries, before);
     EXPECT_EQ(pass.shown(), (Shown{"l=L", "v=V", "vd=!"}));
     EXPECT_EQ(pass.set->read_times[0], 6000u);  // parsed before the failure
-    EXPECT_EQ(pass.set->read_times[1], 5000u);
+    EXPECT_EQ(pass.set->read_times[1], 1001u) << "marked to be read again";
     EXPECT_EQ(mssx_locks_held(), 0);
+    // A failed file is read again at the next request: the failure stands
+    // until the file can be read.
+    EXPECT_EQ(pass.read(), 36);
     mssx_force_open(nullptr, 0);
-    // A failed file is not retried by itself.
-    EXPECT_EQ(pass.read(), 1);
+    EXPECT_EQ(pass.read(), 0);
+    EXPECT_EQ(pass.shown(), (Shown{"l=L", "v=V", "vd=!"}));
 }
 
 TEST_F(MapFiles, FileVanishedBeforeOpening) {
@@ -794,6 +797,54 @@ TEST_F(MapFiles, PassTraceRecords) {
     for (const auto &rec : oxtest::trace_records())
         if (rec.id == 9) parsed.push_back(rec.text(0));
     EXPECT_EQ(parsed, (std::vector<std::string>{kLocalMap}));
+}
+
+// A descriptor that is no regular file is refused by the library itself,
+// whatever the platform library checked: no read, no lock left, and the
+// next request tries again.
+TEST_F(MapFiles, ADescriptorOfNoRegularFileIsRefusedBeforeAnyRead) {
+    OXTEST_REQUIRE_NAMESPACE();
+    ASSERT_EQ(mkfifo(kLocalMap, 0644), 0);
+    mssx_accept_any_file(1);
+    Pass pass;
+    for (int request = 0; request < 2; ++request) {
+        oxtest::clear_errors();
+        EXPECT_EQ(pass.read(), 23);
+        EXPECT_TRUE(reported(23, idm::kMsg655, {"idm__open_mapfile", "22", "idm__ready_mapfile"}));
+        EXPECT_EQ(mssx_locks_held(), 0);
+    }
+}
+
+// A file that changes while it is parsed is parsed again; one that keeps
+// changing fails the pass after three attempts (2650-655, code 11).
+std::atomic<int> g_touches_left{0};
+void touch_while_parsing(int id) {
+    if (id == 43 && g_touches_left.load() > 0 && g_touches_left.fetch_sub(1) > 0)
+        oxtest::set_mtime(kLocalMap, 5000 + g_touches_left.load());
+}
+
+TEST_F(MapFiles, AFileChangedWhileParsedIsParsedAgainThenRefused) {
+    OXTEST_REQUIRE_NAMESPACE();
+    oxtest::set_trace_levels(0, 0, 0, 0, 1);
+    trx_on_record(touch_while_parsing);
+    // Every line parsed touches the file while touches are left; the file
+    // has two lines: 2 touches move one parse, 6 move all three.
+    const struct {
+        int touches;
+        int32_t status;
+    } cases[] = {{2, 0}, {6, 23}};
+    for (const auto &c : cases) {
+        SCOPED_TRACE(c.touches);
+        oxtest::write_file(kLocalMap, "mechA:a=b\nmechA:c=d\n", 1000 + c.touches);
+        g_touches_left.store(c.touches);
+        Pass pass;
+        oxtest::clear_errors();
+        EXPECT_EQ(pass.read(), c.status);
+        if (c.status == 0) EXPECT_EQ(pass.shown(), (Shown{"a=b", "c=d"})) << "each entry once";
+        else EXPECT_TRUE(reported(23, idm::kMsg655, {"idm__parse_mapfile", "11", "idm__native_read_mapfiles"}));
+        EXPECT_EQ(mssx_locks_held(), 0);
+    }
+    trx_on_record(nullptr);
 }
 
 }  // namespace

@@ -200,9 +200,9 @@ TEST_F(SweepMapping, EveryAllocationOfAPassThatReadsTwoFilesAndCachesRules) {
             now = {6, ""};
             next = right;
             break;
-        case kReadFailed:
+        case kReadFailed:  // read again at the next request
             now = {row->returned, ""};
-            next = {0, ""};
+            next = right;
             break;
         case kRuleNotCached:
             now = right;

@@ -81,7 +81,6 @@ constexpr int kReadAttempts = 3;
 struct FileOutcome {
     FileStamp start;          // the open file's size and time, before the parse
     bool held_back = false;   // a cut last line was not acted on
-    bool unreadable = false;  // not a regular file, a read error, or kept changing
     bool overran = false;     // it gave more than its size at the start
 };
 
@@ -400,13 +399,7 @@ void idm__thread_cleanup_cachef(void *set) {
 // One file: opening, reading, one line, the entry array
 // ---------------------------------------------------------------------------
 
-}  // extern "C"
-
-namespace {
-
-// idm__ready_mapfile; the reading pass learns from `outcome` that the path
-// names no regular file.
-int32_t ready_mapfile(const char *path, int32_t *fd, FILE **stream, FileOutcome *outcome) {
+int32_t idm__ready_mapfile(const char *path, int32_t *fd, FILE **stream) {
     static constexpr trace::ApiIds kIds{24, 26, 27, 29};
     static constexpr const char kName[] = "idm__ready_mapfile";
     trace::Api api(kIds, trace::text(path, "[null]"), trace::ptr(fd), trace::ptr(stream));
@@ -439,7 +432,6 @@ int32_t ready_mapfile(const char *path, int32_t *fd, FILE **stream, FileOutcome 
         hold.close();
         r = kNotRegularFile;
     }
-    if (r == kNotRegularFile && outcome != nullptr) outcome->unreadable = true;
     if (trace::diag_on()) trace::record_data(30, trace::text(path), trace::i32(r), trace::i32(d));
     switch (r) {
     case 0: break;
@@ -476,14 +468,6 @@ int32_t ready_mapfile(const char *path, int32_t *fd, FILE **stream, FileOutcome 
     *fd = d;
     *stream = s;
     return leave(0);
-}
-
-}  // namespace
-
-extern "C" {
-
-int32_t idm__ready_mapfile(const char *path, int32_t *fd, FILE **stream) {
-    return ready_mapfile(path, fd, stream, nullptr);
 }
 
 }  // extern "C"
@@ -573,10 +557,7 @@ int32_t parse_mapfile(const char *mechanism, const char *path, FILE *stream, int
     explicit_bzero(piece, sizeof piece);  // the last line read
     // A read error is no end of file: the file's remaining lines, denials
     // among them, were never seen, so the whole pass fails.
-    if (status == 0 && read_error != 0) {
-        if (outcome != nullptr) outcome->unreadable = true;
-        status = report(23, kMsg655, "fgets", read_error, kName);
-    }
+    if (status == 0 && read_error != 0) status = report(23, kMsg655, "fgets", read_error, kName);
     if (trace::diag_on()) trace::record_id(46);
     return leave(status);
 }
@@ -883,9 +864,14 @@ int32_t idm__native_test_mapfiles(idm_mapfile_set *set) {
 namespace {
 
 // Drops the entries from index `from` on (zeroed and freed), leaving the
-// slots zeroed for the list to grow into again.
+// slots zeroed for the list to grow into again; an emptied list has no
+// array, as a list of no entries must.
 void truncate_list(idm_entry_list &list, int32_t from) {
     if (list.entries == nullptr || list.count <= from) return;
+    if (from == 0) {
+        idm__thread_cleanup_entries(&list);
+        return;
+    }
     for (int32_t k = from; k < list.count; ++k) {
         free_secret(list.entries[k].network_id);
         free_secret(list.entries[k].local_id);
@@ -905,7 +891,7 @@ int32_t read_one_file(const char *mechanism, const char *path, idm_entry_list &l
         MapfileHold hold(path);
         idm_open_mapfile &open = hold.file();
         outcome = FileOutcome{};
-        int32_t status = ready_mapfile(open.path, &open.fd, &open.stream, &outcome);
+        int32_t status = idm__ready_mapfile(open.path, &open.fd, &open.stream);
         if (status != 0) return status;
         hold.buffer_stream();
         if (trace::diag_on()) trace::record_data(9, trace::text(open.path));
@@ -924,15 +910,11 @@ int32_t read_one_file(const char *mechanism, const char *path, idm_entry_list &l
         if (status == 0 && outcome.overran && steady) {
             // More text than its unchanged size: no file a writer keeps.
             truncate_list(list, first_entry);
-            outcome.unreadable = true;
             return report(23, kMsg655, "idm__parse_mapfile", kNotRegularFile, kName);
         }
         if (status != 0 || steady) return status;
         truncate_list(list, first_entry);
-        if (attempt == kReadAttempts) {
-            outcome.unreadable = true;
-            return report(23, kMsg655, "idm__parse_mapfile", kKeptChanging, kName);
-        }
+        if (attempt == kReadAttempts) return report(23, kMsg655, "idm__parse_mapfile", kKeptChanging, kName);
     }
 }
 
@@ -980,19 +962,18 @@ int32_t idm__native_read_mapfiles(const char *mechanism, idm_mapfile_set **set, 
         if ((files->flags[i] & MF_IN_USE) == 0) continue;
         FileOutcome outcome;
         int32_t status = read_one_file(mechanism, files->names[i], list, outcome);
-        // A file that could not be read whole, or whose cut last line was
-        // held back, is read again at the next request: its read time is
-        // set to its modification time, which the change test takes for a
-        // parse in the second of the change.  A failure to open or parse an
-        // ordinary file waits for a change, as before.
-        const bool again = outcome.unreadable || outcome.held_back;
+        // A file that could not be read, or whose cut last line was held
+        // back, is read again at the next request: its read time is set to
+        // its modification time, which the change test takes for a parse in
+        // the second of the change.  So a failure stands, reported at every
+        // request, until the file is fixed; it never turns into "no match".
         if (status != 0) {
-            if (again) files->read_times[i] = files->mtimes[i];
+            files->read_times[i] = files->mtimes[i];
             return leave(status);  // the hold of the list frees it
         }
         struct timeval now {};
         cu_gettimeofday_1(&now, nullptr);
-        files->read_times[i] = again ? files->mtimes[i] : static_cast<uint32_t>(now.tv_sec);
+        files->read_times[i] = outcome.held_back ? files->mtimes[i] : static_cast<uint32_t>(now.tv_sec);
         files->flags[i] &= ~MF_REREAD;
     }
 

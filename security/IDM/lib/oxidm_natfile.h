@@ -15,9 +15,11 @@
 //   - the file's size and modification time (fstat) are compared before and
 //     after it is parsed; a file that moved is parsed again, three times at
 //     most, and then the pass fails closed (2650-655, result code 11);
-//   - a file held back from, or failed in one of these ways, is read again at
-//     the next request (its read time is set to its modification time, which
-//     the change test takes for a parse in the second of the change).
+//   - a file whose last line was held back, or that failed in any way (not
+//     only these), is read again at the next request: its read time is set
+//     to its modification time, which the change test takes for a parse in
+//     the second of the change.  A failure stands until the file is fixed; it
+//     never turns into "no line matched" at the next request.
 // What this cannot catch: a writer that rewrites a file in place and pauses
 // exactly at a line feed for longer than the parse leaves a shorter, valid
 // file.  Within one file a prefix can grant only what the whole file grants,
