@@ -29,9 +29,9 @@
 // file last changed in the current or the previous second whose last line
 // has no line feed may be cut short: the load keeps the previous trees and
 // the next query loads again.  A writer that stops at a line feed for longer
-// than a load can still be caught with a shorter file (its last records
-// missing or incomplete); only a writer that replaces the file by rename is
-// safe from that.
+// than a load, or anywhere for more than a second, can still be caught with
+// a shorter file (its last records missing or incomplete, or a cut last
+// line); only a writer that replaces the file by rename is safe from that.
 //
 // The judgement of the text is split from the file walk: parse() and
 // scan_value() are pure functions of a text (no trees, no reports, no

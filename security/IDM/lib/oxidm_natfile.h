@@ -22,7 +22,8 @@
 //     never turns into "no line matched" at the next request.
 // What this cannot catch: a writer that rewrites a file in place and pauses
 // exactly at a line feed for longer than the parse leaves a shorter, valid
-// file.  Within one file a prefix can grant only what the whole file grants,
+// file, and one that pauses for more than a second leaves a cut last line
+// that looks settled.  Within one file a prefix can grant only what the whole file grants,
 // or less (the first match wins), but across files it can grant more: a
 // local file cut short loses denials that would have stopped a broad rule of
 // the global file.  Only a writer that replaces a file by rename, or holds
