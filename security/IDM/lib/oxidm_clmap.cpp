@@ -42,9 +42,9 @@ sec_rwlock idmutex;
 namespace idm::clmap {
 namespace {
 
-constexpr trace::ApiIds kNamesIds{150, 151, 152, 153};
-constexpr trace::ApiIds kActiveIds{140, 141, 142, 143};
-constexpr trace::ApiIds kAnyIds{144, 145, 146, 147};
+constexpr trace::ApiIds kNamesIds{tp::kNamesEntry, tp::kNamesEntryData, tp::kNamesExit, tp::kNamesExitData};
+constexpr trace::ApiIds kActiveIds{tp::kActiveEntry, tp::kActiveEntryData, tp::kActiveExit, tp::kActiveExitData};
+constexpr trace::ApiIds kAnyIds{tp::kAnyEntry, tp::kAnyEntryData, tp::kAnyExit, tp::kAnyExitData};
 constexpr const char kNullHost[] = "<null string>";
 constexpr const char kNullValue[] = "[null!]";
 
@@ -101,14 +101,14 @@ class SpaceTable {
     bool space_[256];
 };
 
-// Trace point 163: the allocation site and the bytes asked for.
+// Trace point kNodeNoMemory: the allocation site and the bytes asked for.
 enum AllocSite : int32_t { kSiteNames = 1, kSiteAddresses, kSiteClusters, kSiteGrowNames, kSiteGrowAddresses,
                            kSiteGrowClusters };
 
 void trace_alloc_failure(int32_t site, size_t bytes) {
     if (!trace::error_on()) return;
     const int64_t asked = static_cast<int64_t>(bytes);
-    trace::record_data(163, trace::i32(site), trace::i64(asked));
+    trace::record_data(tp::kNodeNoMemory, trace::i32(site), trace::i64(asked));
 }
 
 // Empties both trees; the caller holds the write hold.
@@ -225,12 +225,12 @@ constexpr KeywordEntry kKeywords[] = {
 struct AttrRule {
     Attr attr;
     size_t keyword_length;
-    int not_allowed_point;  // outside a record, or already given
-    int no_colon_point;
+    trace::tp::Id not_allowed_point;  // outside a record, or already given
+    trace::tp::Id no_colon_point;
 };
-constexpr AttrRule kNameRule{kNames, 4, 165, 166};
-constexpr AttrRule kAddressRule{kAddresses, 7, 167, 168};
-constexpr AttrRule kClusterRule{kClusters, 7, 169, 170};
+constexpr AttrRule kNameRule{kNames, 4, tp::kNameMisplaced, tp::kNameNoColon};
+constexpr AttrRule kAddressRule{kAddresses, 7, tp::kAddressMisplaced, tp::kAddressNoColon};
+constexpr AttrRule kClusterRule{kClusters, 7, tp::kClusterMisplaced, tp::kClusterNoColon};
 
 // Walks a text; caches the end of the current line so that every search
 // for ":" and LF stays within one pass over the line.
@@ -310,8 +310,8 @@ ParseResult parse(std::string_view text, const ParseSink &sink) {
     Record record;
     size_t pos = 0;
     size_t line = 1;
-    auto invalid = [&](int point, size_t offset, size_t at_line) { return ParseResult{21, point, offset, at_line}; };
-    auto from_sink = [&](int32_t status, size_t offset) { return ParseResult{status, 0, offset, line}; };
+    auto invalid = [&](trace::tp::Id point, size_t offset, size_t at_line) { return ParseResult{21, point, offset, at_line}; };
+    auto from_sink = [&](int32_t status, size_t offset) { return ParseResult{status, trace::tp::Id{}, offset, line}; };
 
     // Reads the value list after the ":" at `colon` into `rule.attr`; leaves
     // `pos` on the line's LF.
@@ -359,11 +359,11 @@ ParseResult parse(std::string_view text, const ParseSink &sink) {
         switch (keyword) {
         case Keyword::kNode: {
             if (record.open) {
-                if (!record.complete()) return invalid(157, record.offset, record.line);
+                if (!record.complete()) return invalid(tp::kNodeRecordIncomplete, record.offset, record.line);
                 if (int32_t s = sink.record(sink.context)) return from_sink(s, statement);
             }
             const size_t colon = cursor.colon(pos + 4);
-            if (colon == std::string_view::npos) return invalid(164, statement, line);
+            if (colon == std::string_view::npos) return invalid(tp::kNodeNoColon, statement, line);
             record = Record{};
             record.open = true;
             record.offset = statement;
@@ -374,7 +374,7 @@ ParseResult parse(std::string_view text, const ParseSink &sink) {
         case Keyword::kName: rule = &kNameRule; break;
         case Keyword::kAddress: rule = &kAddressRule; break;
         case Keyword::kCluster: rule = &kClusterRule; break;
-        case Keyword::kNone: return invalid(171, statement, line);
+        case Keyword::kNone: return invalid(tp::kNoKeyword, statement, line);
         }
         if (!record.open || record.count[rule->attr] != 0) return invalid(rule->not_allowed_point, statement, line);
         const size_t colon = cursor.colon(pos + rule->keyword_length);
@@ -382,10 +382,10 @@ ParseResult parse(std::string_view text, const ParseSink &sink) {
         if (int32_t s = read_values(*rule, colon)) return from_sink(s, statement);
     }
     if (record.open) {
-        if (!record.complete()) return invalid(157, record.offset, record.line);
+        if (!record.complete()) return invalid(tp::kNodeRecordIncomplete, record.offset, record.line);
         if (int32_t s = sink.record(sink.context)) return from_sink(s, text.size());
     }
-    return {0, 0, text.size(), line};
+    return {0, trace::tp::Id{}, text.size(), line};
 }
 
 // Every byte of the copy is written (the value, then its NUL), so there is
@@ -431,7 +431,7 @@ class Builder {
     Builder(const Builder &) = delete;
     Builder &operator=(const Builder &) = delete;
 
-    // 0, or 6 after reporting (2650-654 and trace point 163).
+    // 0, or 6 after reporting (2650-654 and trace point kNodeNoMemory).
     int32_t allocate_lists() {
         static constexpr int32_t kSites[3] = {kSiteNames, kSiteAddresses, kSiteClusters};
         for (int a = 0; a < 3; ++a) {
@@ -493,8 +493,8 @@ class Builder {
     }
 
     void trace_record() const {
-        trace::record_id(158);
-        static constexpr int kPoints[3] = {159, 160, 161};
+        trace::record_id(tp::kNodeRecordComplete);
+        static constexpr trace::tp::Id kPoints[3] = {tp::kNodeRecordName, tp::kNodeRecordAddress, tp::kNodeRecordCluster};
         for (int a = 0; a < 3; ++a)
             for (int32_t i = 0; i < lists_[a].count; ++i) {
                 const char *v = lists_[a].values[i];
@@ -523,14 +523,14 @@ class Builder {
             idm_clnode *node = nullptr;
             if (make_node(key, cluster_bytes, &node) != 0) {
                 if (trace::diag_on())
-                    trace::record_data(162, trace::text(label), trace::text(*key != '\0' ? key : kNullValue));
+                    trace::record_data(tp::kNodeNoTreeRecord, trace::text(label), trace::text(*key != '\0' ? key : kNullValue));
                 return 6;
             }
             void *item = node;
             const int r = sec__rst_insert(tree, &item);
             if (r < 0) {
                 idm__rtree_cleanup_routine(node);
-                if (trace::error_on()) trace::record_data(172, trace::text(label));
+                if (trace::error_on()) trace::record_data(tp::kTreeInsertFailed, trace::text(label));
                 return report(23, kMsg691);
             }
             if (r == 0) idm__rtree_cleanup_routine(node);
@@ -741,7 +741,7 @@ using idm::clmap::MapHold;
 int32_t idm__construct_clcfg(MapHold &hold, const char *text, size_t size) {
     if (trace::diag_on()) {
         const int64_t length = static_cast<int64_t>(size);
-        trace::record_data(155, trace::ptr(text), trace::i64(length));
+        trace::record_data(tp::kNodeFileParsing, trace::ptr(text), trace::i64(length));
     }
     idm::clmap::OldTrees old;
     idm::clmap::Builder builder(size);
@@ -767,9 +767,9 @@ int32_t idm__construct_clcfg(MapHold &hold, const char *text, size_t size) {
 }
 
 int32_t idm__read_clmap_file(MapHold &hold) {
-    if (trace::level(trace::kApi) != 0) trace::record_id(154);
+    if (trace::level(trace::kApi) != 0) trace::record_id(tp::kNodeFileStart);
     const int32_t status = idm::clmap::load(hold);
-    if (trace::level(trace::kApi) != 0) trace::record_data(173, trace::i32(status));
+    if (trace::level(trace::kApi) != 0) trace::record_data(tp::kNodeFileEnd, trace::i32(status));
     return status;
 }
 
@@ -878,16 +878,15 @@ void idm__rtree_cleanup_routine(void *item) {
 }
 
 __attribute__((visibility("default"))) void sec__idm_clmap_init(void) {
-    unsigned char api = trace::level(trace::kApi);
-    if (api == 1 || api == 8) trace::record_id(148);
+    static constexpr trace::ApiIds kIds{tp::kClmapInitEntry, tp::kClmapInitEntry, tp::kClmapInitExit, tp::kClmapInitExit};
+    const trace::Api api(kIds);
     sec__lock_init(&idmutex);
     idm::clmap::store_lastmod(0);
     sec__lock_write(&idmutex);
     sec__rst_init(&nametree, idm__rtree_compare_routine, idm__rtree_cleanup_routine);
     sec__rst_init(&iptree, idm__rtree_compare_routine, idm__rtree_cleanup_routine);
     sec__unlock_write(&idmutex);
-    api = trace::level(trace::kApi);
-    if (api == 1 || api == 8) trace::record_id(149);
+    api.leave(0);
 }
 
 __attribute__((visibility("default"))) int32_t sec_is_in_any_cluster(const char *host) {

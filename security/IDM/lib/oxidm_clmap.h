@@ -43,6 +43,7 @@
 #include <cstdint>
 #include <string_view>
 
+#include "oxidm_tracepoints.h"
 #include "oxsec_lock.h"
 #include "oxsec_rstree.h"
 
@@ -121,12 +122,12 @@ struct ParseSink {
 };
 
 // Outcome of a parse.  status 0: every record was handed over.  status 21:
-// invalid text; `point` is the trace point that names the fault (157, 164
-// to 171), `offset` where the statement begins and `line` its line (from
-// 1).  Any other status came from the sink (point 0).
+// invalid text; `point` is the Error trace point that names the fault,
+// `offset` where the statement begins and `line` its line (from 1).  Any
+// other status came from the sink (point 0).
 struct ParseResult {
     int32_t status;
-    int point;
+    idm::trace::tp::Id point;
     size_t offset;
     size_t line;
 };

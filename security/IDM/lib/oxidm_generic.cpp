@@ -7,9 +7,9 @@ using namespace idm;
 
 namespace {
 
-constexpr trace::ApiIds kRegisterIds{88, 90, 91, 92};
-constexpr trace::ApiIds kMapIds{93, 95, 96, 97};
-constexpr trace::ApiIds kGroupsIds{98, 100, 101, 102};
+constexpr trace::ApiIds kRegisterIds{tp::kRegisterEntry, tp::kRegisterEntryData, tp::kRegisterExit, tp::kRegisterExitData};
+constexpr trace::ApiIds kMapIds{tp::kMapEntry, tp::kMapEntryData, tp::kMapExit, tp::kMapExitData};
+constexpr trace::ApiIds kGroupsIds{tp::kGroupsEntry, tp::kGroupsEntryData, tp::kGroupsExit, tp::kGroupsExitData};
 
 // First or second 32-bit word of the state of the service for `type`, or -1
 // when the type is not valid.

@@ -58,7 +58,7 @@ size_t blank_in(std::string_view s, size_t i, size_t end) {
 
 // Reports 2650-651 for an internal routine and records its Error/Diag trace
 // point with the position and the low 32 bits of the value.
-int32_t bad_param(int32_t status, const char *function, int trace_id, int32_t position, uintptr_t value) {
+int32_t bad_param(int32_t status, const char *function, trace::tp::Id trace_id, int32_t position, uintptr_t value) {
     if (trace::error_on()) {
         uint32_t low = static_cast<uint32_t>(value);
         trace::record_data(trace_id, trace::i32(position), trace::u32(low));
@@ -226,14 +226,27 @@ class SecretCopy {
 // Candidate files
 // ---------------------------------------------------------------------------
 
+// The allocation sites of a set, recorded by trace point kMapfileNamesNoMemory
+// so that a trace tells which of the set's blocks could not be had.
+enum SetSite : int {
+    kSiteSet = 367,
+    kSiteNames = 388,
+    kSiteLocalPath = 420,
+    kSiteGlobalPath = 434,
+    kSiteFallbackPath = 448,
+    kSiteFlags = 475,
+    kSiteMtimes = 488,
+    kSiteReadTimes = 501,
+};
+
 struct Candidate {
     const char *path;  // directory + file name
-    int site;          // allocation site number of its copy (trace 22)
+    SetSite site;      // allocation site of its copy
 };
 constexpr Candidate kCandidates[IDM_MAPFILE_COUNT] = {
-    {"/var/ox/cfg/oxsec_map.local", 420},
-    {"/var/ox/cfg/oxsec_map.global", 434},
-    {"/opt/helvo/cfg/oxsec_map.global", 448},
+    {"/var/ox/cfg/oxsec_map.local", kSiteLocalPath},
+    {"/var/ox/cfg/oxsec_map.global", kSiteGlobalPath},
+    {"/opt/helvo/cfg/oxsec_map.global", kSiteFallbackPath},
 };
 
 // Trims the block under a finished entry list to the smallest multiple of 10
@@ -321,54 +334,49 @@ extern "C" {
 
 int32_t idm__native_get_mapfile_names(idm_mapfile_set **set_out) {
     static constexpr const char kName[] = "idm__native_get_mapfile_names";
-    {
-        unsigned char l = trace::level(trace::kApi);
-        if (l == 1) {
-            trace::record_id(13);
-        } else if (l == 8) {
-            idm_mapfile_set *current = set_out != nullptr ? *set_out : nullptr;
-            trace::record_data(15, trace::ptr(set_out), trace::ptr(current));
-        }
-    }
-    // Exit: a bare id at level 1 and 8, then at level 8 each file of the
-    // stored set.
-    auto leave = [](int32_t status, const idm_mapfile_set *stored) {
-        unsigned char l = trace::level(trace::kApi);
-        if (l == 1 || l == 8) trace::record_id(16);
-        if (l == 8 && stored != nullptr)
+    static constexpr trace::ApiIds kIds{tp::kMapfileNamesEntry, tp::kMapfileNamesEntryData, tp::kMapfileNamesExit,
+                                        tp::kMapfileNamesExit};
+    idm_mapfile_set *const current = set_out != nullptr ? *set_out : nullptr;
+    const trace::Api api(kIds, trace::ptr(set_out), trace::ptr(current));
+    // The exit is a bare id at levels 1 and 8, then at level 8 each file of
+    // the stored set.
+    auto leave = [&api](int32_t status, const idm_mapfile_set *stored) {
+        api.leave(status);
+        if (stored != nullptr && trace::level(trace::kApi) == 8)
             for (int32_t i = 0; i < stored->count; ++i)
-                trace::record_data(17, trace::i32(i), trace::text(name_of(stored, i), "[null]"));
+                trace::record_data(tp::kMapfileNamesFile, trace::i32(i), trace::text(name_of(stored, i), "[null]"));
         return status;
     };
 
-    if (set_out == nullptr) return leave(bad_param(23, kName, 21, 1, 0), nullptr);
+    if (set_out == nullptr) return leave(bad_param(23, kName, tp::kMapfileNamesBadArg, 1, 0), nullptr);
 
     auto no_memory = [&](int site, size_t bytes) {
         if (trace::error_on()) {
             int32_t b = static_cast<int32_t>(bytes);
-            trace::record_data(22, trace::i32(site), trace::i32(b));
+            trace::record_data(tp::kMapfileNamesNoMemory, trace::i32(site), trace::i32(b));
         }
         return leave(report_no_memory(kName, bytes), nullptr);
     };
 
     SetHold building;
     auto *set = static_cast<idm_mapfile_set *>(xmalloc(sizeof(idm_mapfile_set)));
-    if (set == nullptr) return no_memory(367, sizeof(idm_mapfile_set));
+    if (set == nullptr) return no_memory(kSiteSet, sizeof(idm_mapfile_set));
     *set = idm_mapfile_set{IDM_MAPFILE_SET_TAG, IDM_MAPFILE_COUNT, nullptr, nullptr, nullptr, nullptr};
     building.hold(set);
 
     set->names = static_cast<char **>(xcalloc(IDM_MAPFILE_COUNT, sizeof(char *)));
-    if (set->names == nullptr) return no_memory(388, IDM_MAPFILE_COUNT * sizeof(char *));
+    if (set->names == nullptr) return no_memory(kSiteNames, IDM_MAPFILE_COUNT * sizeof(char *));
     for (int32_t i = 0; i < IDM_MAPFILE_COUNT; ++i) {
         set->names[i] = xstrdup(kCandidates[i].path);
         if (set->names[i] == nullptr) return no_memory(kCandidates[i].site, std::strlen(kCandidates[i].path) + 1);
     }
     struct PerFile {
         uint32_t *idm_mapfile_set::*field;
-        int site;
+        SetSite site;
     };
-    static constexpr PerFile kArrays[] = {
-        {&idm_mapfile_set::flags, 475}, {&idm_mapfile_set::mtimes, 488}, {&idm_mapfile_set::read_times, 501}};
+    static constexpr PerFile kArrays[] = {{&idm_mapfile_set::flags, kSiteFlags},
+                                          {&idm_mapfile_set::mtimes, kSiteMtimes},
+                                          {&idm_mapfile_set::read_times, kSiteReadTimes}};
     for (const PerFile &a : kArrays) {
         set->*a.field = static_cast<uint32_t *>(xcalloc(IDM_MAPFILE_COUNT, sizeof(uint32_t)));
         if (set->*a.field == nullptr) return no_memory(a.site, IDM_MAPFILE_COUNT * sizeof(uint32_t));
@@ -400,7 +408,7 @@ void idm__thread_cleanup_cachef(void *set) {
 // ---------------------------------------------------------------------------
 
 int32_t idm__ready_mapfile(const char *path, int32_t *fd, FILE **stream) {
-    static constexpr trace::ApiIds kIds{24, 26, 27, 29};
+    static constexpr trace::ApiIds kIds{tp::kReadyEntry, tp::kReadyEntryData, tp::kReadyExit, tp::kReadyExitData};
     static constexpr const char kName[] = "idm__ready_mapfile";
     trace::Api api(kIds, trace::text(path, "[null]"), trace::ptr(fd), trace::ptr(stream));
     int32_t d = -1;
@@ -409,7 +417,7 @@ int32_t idm__ready_mapfile(const char *path, int32_t *fd, FILE **stream) {
         return api.leave(status, trace::text(path, "[null]"), trace::i32(d), trace::ptr(s));
     };
     auto bad = [&](int32_t position, uintptr_t value) {
-        if (trace::error_on()) trace::record_data(35, trace::i32(position));
+        if (trace::error_on()) trace::record_data(tp::kReadyBadArg, trace::i32(position));
         return leave(report_bad_internal_param(23, kName, position, hex(value)));
     };
     if (path == nullptr || path[0] == '\0') return bad(1, addr(path));
@@ -432,7 +440,7 @@ int32_t idm__ready_mapfile(const char *path, int32_t *fd, FILE **stream) {
         hold.close();
         r = kNotRegularFile;
     }
-    if (trace::diag_on()) trace::record_data(30, trace::text(path), trace::i32(r), trace::i32(d));
+    if (trace::diag_on()) trace::record_data(tp::kReadyOpened, trace::text(path), trace::i32(r), trace::i32(d));
     switch (r) {
     case 0: break;
     case 12: d = -1; return leave(report(36, kMsg653, kName, path));
@@ -442,7 +450,7 @@ int32_t idm__ready_mapfile(const char *path, int32_t *fd, FILE **stream) {
     }
 
     r = sec__readlock_file(d, kName);
-    if (trace::diag_on()) trace::record_data(31, trace::text(path), trace::i32(r));
+    if (trace::diag_on()) trace::record_data(tp::kReadyLocked, trace::text(path), trace::i32(r));
     if (r != 0) {
         hold.close();
         d = -1;
@@ -457,11 +465,11 @@ int32_t idm__ready_mapfile(const char *path, int32_t *fd, FILE **stream) {
         char number[16];
         std::snprintf(number, sizeof number, "%d", d);
         hold.close();
-        if (trace::diag_on()) trace::record_data(34, trace::text(path), trace::i32(e), trace::ptr(s));
+        if (trace::diag_on()) trace::record_data(tp::kReadyNoStream, trace::text(path), trace::i32(e), trace::ptr(s));
         d = -1;
         return leave(report(23, kMsg657, path, number, e));
     }
-    if (trace::diag_on()) trace::record_id(32);
+    if (trace::diag_on()) trace::record_id(tp::kReadyStream);
     // The stream is this thread's alone: no stdio locking per line.
     __fsetlocking(s, FSETLOCKING_BYCALLER);
     hold.release();
@@ -488,7 +496,7 @@ bool at_end(FILE *stream) {
 // stream whole as it stands.
 int32_t parse_mapfile(const char *mechanism, const char *path, FILE *stream, int32_t *count,
                       idm_mapfile_entry **entries, FileOutcome *outcome) {
-    static constexpr trace::ApiIds kIds{36, 38, 39, 40};
+    static constexpr trace::ApiIds kIds{tp::kParseEntry, tp::kParseEntryData, tp::kParseExit, tp::kParseExitData};
     static constexpr const char kName[] = "idm__parse_mapfile";
     int32_t count_now = count != nullptr ? *count : 0;
     trace::Api api(kIds, trace::ptr(stream), trace::ptr(count), trace::i32(count_now), trace::ptr(entries));
@@ -496,13 +504,13 @@ int32_t parse_mapfile(const char *mechanism, const char *path, FILE *stream, int
         count_now = count != nullptr ? *count : 0;
         return api.leave(status, trace::i32(count_now), trace::ptr(entries));
     };
-    if (mechanism == nullptr || mechanism[0] == '\0') return leave(bad_param(23, kName, 47, 1, addr(mechanism)));
-    if (path == nullptr || path[0] == '\0') return leave(bad_param(23, kName, 47, 2, addr(path)));
-    if (stream == nullptr) return leave(bad_param(23, kName, 47, 3, 0));
-    if (count == nullptr) return leave(bad_param(23, kName, 47, 4, 0));
-    if (entries == nullptr) return leave(bad_param(23, kName, 47, 5, 0));
+    if (mechanism == nullptr || mechanism[0] == '\0') return leave(bad_param(23, kName, tp::kParseBadArg, 1, addr(mechanism)));
+    if (path == nullptr || path[0] == '\0') return leave(bad_param(23, kName, tp::kParseBadArg, 2, addr(path)));
+    if (stream == nullptr) return leave(bad_param(23, kName, tp::kParseBadArg, 3, 0));
+    if (count == nullptr) return leave(bad_param(23, kName, tp::kParseBadArg, 4, 0));
+    if (entries == nullptr) return leave(bad_param(23, kName, tp::kParseBadArg, 5, 0));
 
-    if (trace::diag_on()) trace::record_data(42, trace::text(path), trace::text(mechanism));
+    if (trace::diag_on()) trace::record_data(tp::kParseFile, trace::text(path), trace::text(mechanism));
     const std::string_view selector(mechanism);
     const FileStamp start = outcome != nullptr ? outcome->start : FileStamp{};
     const bool hold_cut_line = outcome != nullptr && changed_lately(start);
@@ -524,7 +532,7 @@ int32_t parse_mapfile(const char *mechanism, const char *path, FILE *stream, int
             outcome->overran = true;
             break;
         }
-        if (trace::diag_on()) trace::record_data(43, trace::text(piece));
+        if (trace::diag_on()) trace::record_data(tp::kParseLine, trace::text(piece));
         // The piece as a C string: whatever follows a NUL byte is not seen.
         size_t n = std::strlen(piece);
         if (n > 0 && piece[n - 1] == '\n') {
@@ -538,7 +546,7 @@ int32_t parse_mapfile(const char *mechanism, const char *path, FILE *stream, int
             break;
         }
         if (n == 0) {
-            if (trace::diag_on()) trace::record_id(44);
+            if (trace::diag_on()) trace::record_id(tp::kParseEmptyLine);
             continue;
         }
         if (char *hash = static_cast<char *>(std::memchr(piece, '#', n))) {
@@ -548,7 +556,7 @@ int32_t parse_mapfile(const char *mechanism, const char *path, FILE *stream, int
         // The selector test of idm__test_entry_mech, on the length known here.
         const std::string_view line(piece, n);
         if (only_blanks(line) || !mapfile::selects(selector, line)) {
-            if (trace::diag_on()) trace::record_id(45);
+            if (trace::diag_on()) trace::record_id(tp::kParseSkippedLine);
             continue;
         }
         status = idm__read_mapfile_entries(piece, count, entries);
@@ -558,7 +566,7 @@ int32_t parse_mapfile(const char *mechanism, const char *path, FILE *stream, int
     // A read error is no end of file: the file's remaining lines, denials
     // among them, were never seen, so the whole pass fails.
     if (status == 0 && read_error != 0) status = report(23, kMsg655, "fgets", read_error, kName);
-    if (trace::diag_on()) trace::record_id(46);
+    if (trace::diag_on()) trace::record_id(tp::kParseEnd);
     return leave(status);
 }
 
@@ -577,32 +585,32 @@ int32_t idm__test_entry_mech(const char *mechanism, const char *line) {
 }
 
 int32_t idm__read_mapfile_entries(const char *line, int32_t *count, idm_mapfile_entry **entries) {
-    static constexpr trace::ApiIds kIds{48, 50, 51, 53};
+    static constexpr trace::ApiIds kIds{tp::kEntriesEntry, tp::kEntriesEntryData, tp::kEntriesExit, tp::kEntriesExitData};
     static constexpr const char kName[] = "idm__read_mapfile_entries";
     int32_t count_now = count != nullptr ? *count : 0;
     trace::Api api(kIds, trace::text(line, "<null string>"), trace::i32(count_now), trace::ptr(entries));
     auto leave = [&](int32_t status) { return api.leave(status, trace::ptr(entries)); };
-    if (line == nullptr || line[0] == '\0') return leave(bad_param(23, kName, 59, 1, addr(line)));
-    if (count == nullptr) return leave(bad_param(23, kName, 59, 2, 0));
-    if (*count < 0) return leave(bad_param(23, kName, 59, 2, static_cast<uint32_t>(*count)));
+    if (line == nullptr || line[0] == '\0') return leave(bad_param(23, kName, tp::kEntriesBadArg, 1, addr(line)));
+    if (count == nullptr) return leave(bad_param(23, kName, tp::kEntriesBadArg, 2, 0));
+    if (*count < 0) return leave(bad_param(23, kName, tp::kEntriesBadArg, 2, static_cast<uint32_t>(*count)));
     if (entries == nullptr || (*count == 0 && *entries != nullptr))
-        return leave(bad_param(23, kName, 59, 3, addr(entries)));
+        return leave(bad_param(23, kName, tp::kEntriesBadArg, 3, addr(entries)));
 
     mapfile::LineVerdict v = mapfile::judge_rule(line);
     if (v.kind != mapfile::LineKind::kAffirmative && v.kind != mapfile::LineKind::kDenial) {
-        if (trace::diag_on()) trace::record_id(56);
+        if (trace::diag_on()) trace::record_id(tp::kEntriesInvalidLine);
         return leave(0);
     }
     const bool denial = v.kind == mapfile::LineKind::kDenial;
 
-    auto no_memory = [&](int trace_id, size_t bytes) {
+    auto no_memory = [&](trace::tp::Id trace_id, size_t bytes) {
         int32_t b = static_cast<int32_t>(bytes);
         if (trace::error_on()) trace::record_data(trace_id, trace::i32(b));
         return leave(report(23, kMsg658, kName, b));
     };
     SecretCopy network, local;
-    if (!network.make(v.network_id)) return no_memory(62, v.network_id.size() + 1);
-    if (!denial && !local.make(v.local_id)) return no_memory(65, v.local_id.size() + 1);
+    if (!network.make(v.network_id)) return no_memory(tp::kEntriesNoNetworkCopy, v.network_id.size() + 1);
+    if (!denial && !local.make(v.local_id)) return no_memory(tp::kEntriesNoLocalCopy, v.local_id.size() + 1);
 
     if (int32_t status = idm__alloc_entries(*count, entries); status != 0) return leave(status);
 
@@ -615,15 +623,15 @@ int32_t idm__read_mapfile_entries(const char *line, int32_t *count, idm_mapfile_
     e.local_id = local.release();
     ++*count;
     if (trace::diag_on())
-        trace::record_data(58, trace::i64(e.read_time),
+        trace::record_data(tp::kEntriesNewEntry, trace::i64(e.read_time),
                            trace::text(denial ? "Denial of mapping" : "Affirmative mapping"),
                            trace::text(e.network_id), trace::text(e.local_id, ""));
     return leave(0);
 }
 
 int32_t idm__alloc_entries(int32_t count, idm_mapfile_entry **entries) {
-    if (count < 0) return bad_param(23, "idm__alloc_entries", 59, 1, static_cast<uint32_t>(count));
-    if (entries == nullptr) return bad_param(23, "idm__alloc_entries", 59, 2, 0);
+    if (count < 0) return bad_param(23, "idm__alloc_entries", tp::kEntriesBadArg, 1, static_cast<uint32_t>(count));
+    if (entries == nullptr) return bad_param(23, "idm__alloc_entries", tp::kEntriesBadArg, 2, 0);
     if (count % 10 != 0) return 0;
     // The list grows by ten slots: every tenth entry is one enlargement,
     // with its own failure point and the size of count + 10 entries.  The
@@ -633,7 +641,7 @@ int32_t idm__alloc_entries(int32_t count, idm_mapfile_entry **entries) {
     // over.
     const size_t bytes = (static_cast<size_t>(count) + 10) * sizeof(idm_mapfile_entry);
     int32_t bytes32 = static_cast<int32_t>(bytes);
-    if (trace::diag_on()) trace::record_data(55, trace::i32(count), trace::i32(bytes32));
+    if (trace::diag_on()) trace::record_data(tp::kEntriesGrow, trace::i32(count), trace::i32(bytes32));
     idm_mapfile_entry *array = *entries;
     bool grown = false;
     if (array != nullptr && malloc_usable_size(array) >= bytes) {
@@ -652,7 +660,7 @@ int32_t idm__alloc_entries(int32_t count, idm_mapfile_entry **entries) {
         }
     }
     if (!grown) {
-        if (trace::error_on()) trace::record_data(61, trace::i32(bytes32));
+        if (trace::error_on()) trace::record_data(tp::kEntriesGrowFailed, trace::i32(bytes32));
         report(23, kMsg658, "idm_alloc_entries", bytes32);
         return 6;
     }
@@ -687,7 +695,7 @@ void idm__thread_cleanup_mapfile(void *open_mapfile) {
     if (f == nullptr || f->fd == -1) return;
     if (trace::diag_on()) {
         f->path[IDM_MAPFILE_PATH_MAX] = '\0';
-        trace::record_data(87, trace::text(f->path), trace::i32(f->fd), trace::ptr(f->stream));
+        trace::record_data(tp::kMapfileReleased, trace::text(f->path), trace::i32(f->fd), trace::ptr(f->stream));
     }
     sec__unlock_file(f->fd, "idm__thread_cleanup_mapfile");
     if (f->stream != nullptr) {
@@ -706,16 +714,9 @@ void idm__thread_cleanup_mapfile(void *open_mapfile) {
 
 int32_t idm__native_test_mapfiles_v1(idm_mapfile_set *set, int32_t index, int32_t superseder) {
     static constexpr const char kName[] = "idm__native_test_mapfiles_v1";
-    {
-        unsigned char l = trace::level(trace::kApi);
-        if (l == 1 || l == 8) trace::record_id(67);
-    }
-    auto leave = [](int32_t result) {
-        unsigned char l = trace::level(trace::kApi);
-        if (l == 1) trace::record_id(78);
-        else if (l == 8) trace::record_data(79, trace::i32(result));
-        return result;
-    };
+    static constexpr trace::ApiIds kIds{tp::kTestFileEntry, tp::kTestFileEntry, tp::kTestFileExit, tp::kTestFileExitData};
+    const trace::Api api(kIds);
+    auto leave = [&api](int32_t result) { return api.leave(result); };
     if (set == nullptr || set->names == nullptr || set->flags == nullptr || set->mtimes == nullptr ||
         set->read_times == nullptr)
         return leave(report_bad_internal_param(23, kName, 1, hex(set)));
@@ -733,70 +734,70 @@ int32_t idm__native_test_mapfiles_v1(idm_mapfile_set *set, int32_t index, int32_
     uint32_t &mtime = set->mtimes[index];
     uint32_t &read_time = set->read_times[index];
     const bool diag = trace::diag_on();
-    auto note = [&](int id) {
+    auto note = [&](trace::tp::Id id) {
         if (diag) trace::record_data(id, trace::text(path, "[null]"));
     };
     auto note_superseded = [&]() {
-        if (diag) trace::record_data(71, trace::text(path, "[null]"), trace::text(set->names[superseder], "[null]"));
+        if (diag) trace::record_data(tp::kTestFileSuperseded, trace::text(path, "[null]"), trace::text(set->names[superseder], "[null]"));
     };
     const bool superseded = superseder >= 0 && (set->flags[superseder] & MF_PRESENT) != 0;
 
     if (r == 21) {
         if ((flags & MF_PRESENT) == 0) {  // still absent
             flags &= ~MF_REMOVED;
-            note(75);
+            note(tp::kTestFileUnchanged);
             return leave(1);
         }
         flags &= ~(MF_PRESENT | MF_IN_USE | MF_REREAD);  // removed
         flags |= MF_REMOVED;
         mtime = 0;
         read_time = 0;
-        note(76);
+        note(tp::kTestFileRemoved);
         return leave(0);
     }
 
     if ((flags & MF_PRESENT) == 0) {  // appeared
         mtime = m;
-        note(68);
+        note(tp::kTestFileAppeared);
         if (superseded) {
             flags = MF_PRESENT;
             note_superseded();
             return leave(1);
         }
         flags = MF_PRESENT | MF_IN_USE | MF_REREAD;
-        note(69);
+        note(tp::kTestFileAppearedInUse);
         return leave(0);
     }
 
-    note(72);  // still present
+    note(tp::kTestFileStillPresent);  // still present
     if (superseded) {
         const bool unchanged_unread = m == mtime && mtime != read_time;
         flags = MF_PRESENT;
         mtime = m;
         note_superseded();
-        if (unchanged_unread) note(75);
+        if (unchanged_unread) note(tp::kTestFileUnchanged);
         return leave(1);
     }
 
     flags = MF_PRESENT | MF_IN_USE;
-    note(73);
+    note(tp::kTestFileSelected);
     bool changed = true;
     if (m != mtime) {
         mtime = m;
         flags |= MF_REREAD;
-        note(74);
+        note(tp::kTestFileTimeChanged);
     } else if (mtime == read_time) {
         // Parsed in the very second of the last change: a rewrite later in
         // that second would not show, so read again.
         flags |= MF_REREAD;
-        note(70);
+        note(tp::kTestFileSameSecond);
     } else {
         changed = false;
-        note(75);
+        note(tp::kTestFileUnchanged);
     }
     if (superseder >= 0 && (set->flags[superseder] & MF_REMOVED) != 0) {
         flags |= MF_REREAD;
-        note(77);
+        note(tp::kTestFileUnsuperseded);
         return leave(0);
     }
     return leave(changed ? 0 : 1);
@@ -804,27 +805,20 @@ int32_t idm__native_test_mapfiles_v1(idm_mapfile_set *set, int32_t index, int32_
 
 int32_t idm__native_test_mapfiles(idm_mapfile_set *set) {
     static constexpr const char kName[] = "idm__native_test_mapfiles";
-    {
-        unsigned char l = trace::level(trace::kApi);
-        if (l == 1 || l == 8) trace::record_id(80);
-    }
-    auto leave = [](int32_t result) {
-        unsigned char l = trace::level(trace::kApi);
-        if (l == 1) trace::record_id(84);
-        else if (l == 8) trace::record_data(85, trace::i32(result));
-        return result;
-    };
+    static constexpr trace::ApiIds kIds{tp::kTestFilesEntry, tp::kTestFilesEntry, tp::kTestFilesExit, tp::kTestFilesExitData};
+    const trace::Api api(kIds);
+    auto leave = [&api](int32_t result) { return api.leave(result); };
     auto deselect_all = [set]() {
         if (set->flags == nullptr) return;
         for (int32_t i = 0; i < set->count; ++i) set->flags[i] &= ~(MF_IN_USE | MF_REREAD);
     };
 
     if (set == nullptr) {
-        bad_param(4, kName, 81, 1, 0);
+        bad_param(4, kName, tp::kTestFilesBadArg, 1, 0);
         return leave(1);
     }
     if (uint32_t version = set->tag & 0xffu; version != IDM_MAPFILE_SET_VERSION) {
-        if (trace::error_on()) trace::record_data(82, trace::u32(version));
+        if (trace::error_on()) trace::record_data(tp::kTestFilesBadVersion, trace::u32(version));
         report(23, kMsg655, kName, 23, "[ignored]");
         deselect_all();
         return leave(1);
@@ -847,7 +841,7 @@ int32_t idm__native_test_mapfiles(idm_mapfile_set *set) {
             uint32_t f = set->flags[i];
             int32_t present = (f & MF_PRESENT) != 0, in_use = (f & MF_IN_USE) != 0;
             int32_t removed = (f & MF_REMOVED) != 0, reread = (f & MF_REREAD) != 0;
-            trace::record_data(83, trace::i32(i), trace::text(name_of(set, i), "[null]"), trace::i32(present),
+            trace::record_data(tp::kTestFilesState, trace::i32(i), trace::text(name_of(set, i), "[null]"), trace::i32(present),
                                trace::i32(in_use), trace::i32(removed), trace::i32(reread), trace::u32(set->mtimes[i]),
                                trace::u32(set->read_times[i]));
         }
@@ -894,7 +888,7 @@ int32_t read_one_file(const char *mechanism, const char *path, idm_entry_list &l
         int32_t status = idm__ready_mapfile(open.path, &open.fd, &open.stream);
         if (status != 0) return status;
         hold.buffer_stream();
-        if (trace::diag_on()) trace::record_data(9, trace::text(open.path));
+        if (trace::diag_on()) trace::record_data(tp::kReadMapfilesParsing, trace::text(open.path));
         outcome.start = stamp_of(open.fd);
         status = parse_mapfile(mechanism, open.path, open.stream, &list.count, &list.entries, &outcome);
         const bool steady = stamp_of(open.fd) == outcome.start;
@@ -925,31 +919,23 @@ extern "C" {
 int32_t idm__native_read_mapfiles(const char *mechanism, idm_mapfile_set **set, int32_t *count,
                                   idm_mapfile_entry **entries) {
     static constexpr const char kName[] = "idm__native_read_mapfiles";
-    {
-        unsigned char l = trace::level(trace::kApi);
-        if (l == 1 || l == 8) trace::record_id(4);
-    }
+    static constexpr trace::ApiIds kIds{tp::kReadMapfilesEntry, tp::kReadMapfilesEntry, tp::kReadMapfilesExit,
+                                        tp::kReadMapfilesExitData};
+    const trace::Api api(kIds);
     auto leave = [&](int32_t status) {
-        unsigned char l = trace::level(trace::kApi);
-        if (l == 1) {
-            trace::record_id(5);
-        } else if (l == 8) {
-            idm_mapfile_set *s = set != nullptr ? *set : nullptr;
-            int32_t c = count != nullptr ? *count : 0;
-            trace::record_data(12, trace::i32(status), trace::ptr(set), trace::ptr(s), trace::ptr(count), trace::i32(c),
-                               trace::ptr(entries));
-        }
-        return status;
+        idm_mapfile_set *const s = set != nullptr ? *set : nullptr;
+        const int32_t c = count != nullptr ? *count : 0;
+        return api.leave(status, trace::ptr(set), trace::ptr(s), trace::ptr(count), trace::i32(c), trace::ptr(entries));
     };
 
     EntriesHold building;  // the list this pass builds, freed unless handed over
 
-    if (mechanism == nullptr || mechanism[0] == '\0') return leave(bad_param(23, kName, 6, 1, addr(mechanism)));
-    if (set == nullptr) return leave(bad_param(23, kName, 6, 2, 0));
-    if (count == nullptr) return leave(bad_param(23, kName, 6, 3, 0));
-    if (entries == nullptr) return leave(bad_param(23, kName, 6, 4, 0));
+    if (mechanism == nullptr || mechanism[0] == '\0') return leave(bad_param(23, kName, tp::kReadMapfilesBadArg, 1, addr(mechanism)));
+    if (set == nullptr) return leave(bad_param(23, kName, tp::kReadMapfilesBadArg, 2, 0));
+    if (count == nullptr) return leave(bad_param(23, kName, tp::kReadMapfilesBadArg, 3, 0));
+    if (entries == nullptr) return leave(bad_param(23, kName, tp::kReadMapfilesBadArg, 4, 0));
     if (trace::level(trace::kApi) == 8 || trace::diag_on())
-        trace::record_data(8, trace::text(mechanism), trace::ptr(set), trace::ptr(*set), trace::ptr(count),
+        trace::record_data(tp::kReadMapfilesArgs, trace::text(mechanism), trace::ptr(set), trace::ptr(*set), trace::ptr(count),
                            trace::i32(*count), trace::ptr(entries), trace::ptr(*entries));
 
     if (*set == nullptr)

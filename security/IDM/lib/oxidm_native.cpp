@@ -29,7 +29,7 @@ extern "C" {
 // or 23 (2650-661, 2650-655); a failed creation leaves the list unchanged.
 int32_t idm__native_register_translator(const char *mnemonic, idm_translator_routine translator,
                                         idm_cleanup_routine cleanup) {
-    static constexpr trace::ApiIds kIds{103, 105, 106, 107};
+    static constexpr trace::ApiIds kIds{tp::kNativeRegisterEntry, tp::kNativeRegisterEntryData, tp::kNativeRegisterExit, tp::kNativeRegisterExitData};
     static constexpr const char kName[] = "idm__native_register_translator";
     trace::Api api(kIds, trace::text(mnemonic), trace::ptr(translator), trace::ptr(cleanup));
     pthread_once(&idm__native_init_once_block, idm__native_state_init);
@@ -130,7 +130,7 @@ struct idm_entry_list_release {
 // including every call of the MPM's routines; the holds are released if the
 // thread is cancelled inside one of them.
 int32_t idm__native_map_identity(const char *mnemonic, const char *network_id, idm_buffer *local) {
-    static constexpr trace::ApiIds kIds{108, 110, 111, 112};
+    static constexpr trace::ApiIds kIds{tp::kNativeMapEntry, tp::kNativeMapEntryData, tp::kNativeMapExit, tp::kNativeMapExitData};
     trace::Api api(kIds, trace::text(mnemonic), trace::text(network_id), trace::ptr(local));
     pthread_once(&idm__native_init_once_block, idm__native_state_init);
     idm_translator *record = idm__native_find_translator(mnemonic);
@@ -401,7 +401,7 @@ int32_t scan_groups(const char *name, size_t gr_size, bool primary, GroupList &l
 // (2650-698, 2650-699, 2650-700); on failure *count is 0 and *groups null
 // and nothing of the call stays allocated.
 int32_t idm__native_get_groups(idm_buffer *user, uint32_t *count, idm_buffer **groups) {
-    static constexpr trace::ApiIds kIds{113, 115, 116, 117};
+    static constexpr trace::ApiIds kIds{tp::kNativeGroupsEntry, tp::kNativeGroupsEntryData, tp::kNativeGroupsExit, tp::kNativeGroupsExitData};
     trace::Api api(kIds, trace::ptr(user), trace::ptr(count), trace::ptr(groups));
     *count = 0;
     *groups = nullptr;

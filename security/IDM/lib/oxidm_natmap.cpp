@@ -38,25 +38,6 @@ inline bool same_text(const char *a, const char *b) {
     return false;
 }
 
-// Entry and exit points of the two checks.  At API level 8 the entry record
-// is followed by the dump of the structure; the level is read once for both.
-template <class T>
-[[gnu::always_inline]] inline void enter(const trace::ApiIds &ids, T *p, void (*dump)(const T *)) {
-    unsigned char l = trace::level(trace::kApi);
-    if (l == 1) {
-        trace::record_id(ids.entry);
-    } else if (l == 8) {
-        trace::record_data(ids.entry_data, trace::ptr(p));
-        dump(p);
-    }
-}
-[[gnu::always_inline]] inline int32_t leave(const trace::ApiIds &ids, int32_t status) {
-    unsigned char l = trace::level(trace::kApi);
-    if (l == 1) trace::record_id(ids.exit);
-    else if (l == 8) trace::record_data(ids.exit_data, trace::i32(status));
-    return status;
-}
-
 // Number of '*' in s, stopping at 2: only "none", "one" and "more" matter.
 inline int stars(const char *s) {
     int n = 0;
@@ -156,11 +137,12 @@ int32_t idm__native_match_token(const char *rule_token, const char *id_token) {
 }
 
 int32_t idm__native_check_rule(idm_rule *rule) {
-    static constexpr trace::ApiIds kIds{118, 120, 121, 122};
-    enter<idm_rule>(kIds, rule, idm__trace_native_rule);
+    static constexpr trace::ApiIds kIds{tp::kCheckRuleEntry, tp::kCheckRuleEntryData, tp::kCheckRuleExit, tp::kCheckRuleExitData};
+    const trace::Api api(kIds, trace::ptr(rule));
+    if (api.entered_with_data()) idm__trace_native_rule(rule);
 
     uint32_t low = rule->rule_state & kLowHalf;
-    if (low == IDM_RULE_VALID) return leave(kIds, 0);
+    if (low == IDM_RULE_VALID) return api.leave(0);
     if (low == IDM_RULE_UNCHECKED) {
         auto flag = [rule](uint32_t f) { rule->rule_state |= f; };
         if (!nonempty(rule->rgy_type) || !nonempty(rule->rgy)) flag(IDM_RULE_BAD_RGY);
@@ -187,7 +169,7 @@ int32_t idm__native_check_rule(idm_rule *rule) {
         if ((rule->rule_state & kLowHalf) == 0) {
             if (mapping == nullptr || rule->rule_state != 0) {
                 rule->rule_state = IDM_RULE_VALID;
-                return leave(kIds, 0);
+                return api.leave(0);
             }
             const char *value = mapping->value;
             if (std::strcmp(value, "*") == 0) {
@@ -212,26 +194,27 @@ int32_t idm__native_check_rule(idm_rule *rule) {
                     rule->rule_state = IDM_RULE_AMBIGUOUS;
                 } else {
                     rule->rule_state = static_cast<uint32_t>(at) * kPositionUnit + IDM_RULE_VALID;
-                    return leave(kIds, 0);
+                    return api.leave(0);
                 }
             } else if (std::strchr(value, IDM_WILDCARD) != nullptr) {
                 rule->rule_state = IDM_RULE_AMBIGUOUS;
             } else {
                 rule->rule_state = IDM_RULE_VALID;
-                return leave(kIds, 0);
+                return api.leave(0);
             }
         }
     }
-    return leave(kIds, report(38, kMsg662));
+    return api.leave(report(38, kMsg662));
 }
 
 int32_t idm__native_check_id(idm_id *id) {
-    static constexpr trace::ApiIds kIds{123, 125, 126, 127};
-    enter<idm_id>(kIds, id, idm__trace_native_id);
+    static constexpr trace::ApiIds kIds{tp::kCheckIdEntry, tp::kCheckIdEntryData, tp::kCheckIdExit, tp::kCheckIdExitData};
+    const trace::Api api(kIds, trace::ptr(id));
+    if (api.entered_with_data()) idm__trace_native_id(id);
     int32_t status = 0;
     if (!nonempty(id->rgy_type) || !nonempty(id->rgy) || id->token_cnt <= 0 || id->tokens == nullptr)
         status = report(38, kMsg665);
-    return leave(kIds, status);
+    return api.leave(status);
 }
 
 // ---------------------------------------------------------------------------
@@ -264,7 +247,7 @@ int32_t idm__native_get_mapping(idm_rule *rule, idm_id *id, idm_buffer *result) 
 }
 
 int32_t idm__native_apply_rule(idm_rule *rule, idm_id *id, idm_buffer *result) {
-    static constexpr trace::ApiIds kIds{128, 130, 134, 135};
+    static constexpr trace::ApiIds kIds{tp::kApplyEntry, tp::kApplyEntryData, tp::kApplyExit, tp::kApplyExitData};
     trace::Api api(kIds, trace::ptr(rule), trace::ptr(id), trace::ptr(result));
 
     if (int32_t s = idm__native_check_rule(rule); s != 0) return api.leave(s);
@@ -283,12 +266,12 @@ int32_t idm__native_apply_rule(idm_rule *rule, idm_id *id, idm_buffer *result) {
         char id_line[kLineBuffer];
         token_line(rule_line, rule->token_cnt, rule->tokens);
         token_line(id_line, id->token_cnt, id->tokens);
-        trace::record_data(131, trace::text(or_null(rule->rgy_type)), trace::text(or_null(rule->rgy)),
+        trace::record_data(tp::kApplyMatched, trace::text(or_null(rule->rgy_type)), trace::text(or_null(rule->rgy)),
                            trace::i32(rule->token_cnt), trace::text(rule_line), trace::text(or_null(id->rgy_type)),
                            trace::text(or_null(id->rgy)), trace::i32(id->token_cnt), trace::text(id_line));
     }
     l = trace::level(trace::kMapping);
-    if (l == 2 || l == 8) trace::record_data(133, trace::text(or_null(result->value)));
+    if (l == 2 || l == 8) trace::record_data(tp::kApplyResult, trace::text(or_null(result->value)));
     return api.leave(0);
 }
 

@@ -42,9 +42,9 @@ int idm__trace_unregister_oxidm(void) { return tr_unregister_component_1(trace::
 int idm__trace_routine_end(const char *name, int32_t status) {
     unsigned char l = trace::level(trace::kApi);
     if (name == nullptr || *name == '\0') return 0;
-    if (l == 1) return tr_record_strings_1(trace::kComponent, 2, 1, name);
+    if (l == 1) return tr_record_strings_1(trace::kComponent, trace::tp::kRoutineEndName, 1, name);
     if (l == 8)
-        return tr_record_data_1(trace::kComponent, 3, 2, static_cast<const void *>(name), std::strlen(name) + 1,
+        return tr_record_data_1(trace::kComponent, trace::tp::kRoutineEndData, 2, static_cast<const void *>(name), std::strlen(name) + 1,
                                 static_cast<const void *>(&status), size_t{4});
     return 0;
 }
@@ -52,7 +52,7 @@ int idm__trace_routine_end(const char *name, int32_t status) {
 static void trace_tokens(int32_t count, char *const *tokens) {
     for (int32_t i = 1; i <= count; ++i) {
         const char *token = tokens != nullptr ? tokens[i - 1] : nullptr;
-        trace::record_data(139, trace::i32(i), trace::text(token != nullptr ? token : null_string));
+        trace::record_data(tp::kDumpToken, trace::i32(i), trace::text(token != nullptr ? token : null_string));
     }
 }
 
@@ -61,12 +61,12 @@ void idm__trace_native_rule(const idm_rule *rule) {
     idm_rule copy = *rule;
     if (copy.rgy_type == nullptr) copy.rgy_type = const_cast<char *>(null_string);
     if (copy.rgy == nullptr) copy.rgy = const_cast<char *>(null_string);
-    trace::record_data(136, trace::u32(copy.rule_state), trace::text(copy.rgy_type), trace::text(copy.rgy),
+    trace::record_data(tp::kDumpRule, trace::u32(copy.rule_state), trace::text(copy.rgy_type), trace::text(copy.rgy),
                        trace::i32(copy.token_cnt));
     trace_tokens(copy.token_cnt, copy.tokens);
     if (copy.mapping != nullptr) {
         const char *value = copy.mapping->value != nullptr ? copy.mapping->value : null_string;
-        trace::record_data(138, trace::u32(copy.mapping->length), trace::text(value));
+        trace::record_data(tp::kDumpRuleMapping, trace::u32(copy.mapping->length), trace::text(value));
     }
 }
 
@@ -75,7 +75,7 @@ void idm__trace_native_id(const idm_id *id) {
     idm_id copy = *id;
     if (copy.rgy_type == nullptr) copy.rgy_type = const_cast<char *>(null_string);
     if (copy.rgy == nullptr) copy.rgy = const_cast<char *>(null_string);
-    trace::record_data(137, trace::text(copy.rgy_type), trace::text(copy.rgy), trace::i32(copy.token_cnt));
+    trace::record_data(tp::kDumpId, trace::text(copy.rgy_type), trace::text(copy.rgy), trace::i32(copy.token_cnt));
     trace_tokens(copy.token_cnt, copy.tokens);
 }
 

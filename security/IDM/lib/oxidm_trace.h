@@ -21,6 +21,7 @@
 #include <utility>
 
 #include "ox_tr.h"
+#include "oxidm_tracepoints.h"
 
 extern "C" {
 extern unsigned char idm__trace_detail_levels[5];
@@ -40,8 +41,6 @@ void idm__trace_register_once_routine(void);
 namespace idm::trace {
 
 inline constexpr const char kComponent[] = "_SEI";
-
-enum Category : int { kError = 0, kApi = 1, kMapping = 2, kMilestone = 3, kDiag = 4 };
 
 // Runs the registration once-control and reads one level byte.  The
 // once-control is checked inline first: once registration has run, a trace
@@ -70,7 +69,7 @@ inline Item i64(const int64_t &v) { return {&v, 8}; }
 template <class T>
 inline Item ptr(T *const &p) { return {&p, 8}; }
 
-inline void record_id(int id) { tr_record_id_1(kComponent, id); }
+inline void record_id(tp::Id id) { tr_record_id_1(kComponent, id); }
 
 template <size_t I, size_t N>
 inline auto flat(const std::array<Item, N> &a) {
@@ -78,12 +77,12 @@ inline auto flat(const std::array<Item, N> &a) {
     else return a[I / 2].len;
 }
 template <size_t N, size_t... I>
-inline void record_flat(int id, const std::array<Item, N> &a, std::index_sequence<I...>) {
+inline void record_flat(tp::Id id, const std::array<Item, N> &a, std::index_sequence<I...>) {
     tr_record_data_1(kComponent, id, static_cast<int>(N), flat<I>(a)...);
 }
 
 template <class... Items>
-inline void record_data(int id, Items... items) {
+inline void record_data(tp::Id id, Items... items) {
     std::array<Item, sizeof...(Items)> a{items...};
     for (Item &it : a)
         if (it.len == kTextLen) it.len = std::strlen(static_cast<const char *>(it.p)) + 1;
@@ -91,40 +90,45 @@ inline void record_data(int id, Items... items) {
 }
 
 template <class... Texts>
-inline void record_strings(int id, Texts... texts) {
+inline void record_strings(tp::Id id, Texts... texts) {
     tr_record_strings_1(kComponent, id, static_cast<int>(sizeof...(Texts)), static_cast<const char *>(texts)...);
 }
 
-// The four ids of a routine traced with the entry/exit pattern.
-struct ApiIds {
-    int entry;       // API level 1
-    int entry_data;  // API level 8
-    int exit;        // API level 1
-    int exit_data;   // API level 8
-};
-
-// Entry point in the constructor, exit point in leave(); leave() reads the
-// API level afresh, as it may have changed meanwhile.
+// The entry and exit pattern: the entry point in the constructor, the exit
+// point in leave(), which reads the API level afresh, as it may have changed
+// meanwhile.  At level 1 the bare entry or exit id; at level 8 the data
+// record with the items, or the bare id again where the routine names the
+// same id for both levels.
 class Api {
   public:
     template <class... Items>
-    explicit Api(const ApiIds &ids, Items... items) : ids_(ids) {
-        unsigned char l = level(kApi);
-        if (l == 1) record_id(ids_.entry);
-        else if (l == 8) record_data(ids_.entry_data, items...);
+    explicit Api(const ApiIds &ids, Items... items) : ids_(ids), entered_(level(kApi)) {
+        if (entered_ == 1) record_id(ids_.entry);
+        else if (entered_ == 8 && ids_.entry_data == ids_.entry) record_id(ids_.entry);
+        else if (entered_ == 8) record_data(ids_.entry_data, items...);
     }
+    // Whether the entry point was recorded with data (API level 8).
+    bool entered_with_data() const { return entered_ == 8; }
     template <class... Items>
     int32_t leave(int32_t status, Items... more) const {
-        unsigned char l = level(kApi);
+        const unsigned char l = level(kApi);
         if (l == 1) record_id(ids_.exit);
+        else if (l == 8 && ids_.exit_data == ids_.exit) record_id(ids_.exit);
         else if (l == 8) record_data(ids_.exit_data, i32(status), more...);
         return status;
     }
+    Api(const Api &) = delete;
+    Api &operator=(const Api &) = delete;
 
   private:
     const ApiIds &ids_;
+    const unsigned char entered_;
 };
 
 }  // namespace idm::trace
+
+namespace idm {
+namespace tp = trace::tp;
+}
 
 #endif
