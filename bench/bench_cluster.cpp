@@ -28,7 +28,7 @@
 #include "namespace.h"
 #include "oxidm.h"
 #include "oxidm_clmap.h"
-#include "oxidm_internal.h"
+#include "oxidm_state.h"
 
 namespace {
 

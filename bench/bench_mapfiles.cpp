@@ -20,7 +20,7 @@
 #include <string>
 
 #include "namespace.h"
-#include "oxidm_internal.h"
+#include "oxidm_state.h"
 #include "oxidm_natfile.h"
 
 namespace {

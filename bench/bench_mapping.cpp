@@ -32,7 +32,7 @@
 
 #include "namespace.h"
 #include "oxidm.h"
-#include "oxidm_internal.h"
+#include "oxidm_state.h"
 #include "oxidm_natmap.h"
 #include "oxmpm_host.h"
 

@@ -34,7 +34,7 @@
 #include <vector>
 
 #include "fuzz_common.h"
-#include "oxidm_internal.h"
+#include "oxidm_state.h"
 #include "oxidm_natmap.h"
 
 namespace {

@@ -18,7 +18,7 @@
 #include <vector>
 
 #include "fuzz_common.h"
-#include "oxidm_internal.h"
+#include "oxidm_state.h"
 #include "oxidm_natfile.h"
 
 namespace {

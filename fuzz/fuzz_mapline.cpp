@@ -16,7 +16,7 @@
 #include <string>
 
 #include "fuzz_common.h"
-#include "oxidm_internal.h"
+#include "oxidm_state.h"
 #include "oxidm_natfile.h"
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size) {

@@ -19,7 +19,7 @@
 #include <string>
 
 #include "fuzz_common.h"
-#include "oxidm_internal.h"
+#include "oxidm_state.h"
 #include "oxidm_natmap.h"
 
 namespace {

@@ -22,7 +22,7 @@
 
 #include "fuzz_common.h"
 #include "oxidm_clmap.h"
-#include "oxidm_internal.h"
+#include "oxidm_state.h"
 
 namespace {
 

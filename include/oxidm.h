@@ -85,15 +85,37 @@ typedef struct idm_id {
     char **tokens;     /* byte 24 */
 } idm_id;
 
+/* Statuses of the exported functions, and those a translator routine
+ * returns that the mapping walk acts on.  Each status that comes with a
+ * message names its numbers (catalogue oxseclib.cat, set 1). */
+enum idm_status {
+    IDM_OK = 0,
+    IDM_E_BAD_PARAMETER = 4,   /* 2650-650 */
+    IDM_E_NO_MEMORY = 6,       /* 2650-654 */
+    IDM_E_GROUPS = 15,         /* 2650-698 unknown user, 2650-699, 2650-700 */
+    IDM_E_NODE_FILE = 21,      /* 2650-690, 2650-692 to 2650-694 */
+    IDM_E_NO_TRANSLATOR = 22,  /* 2650-660 */
+    IDM_E_INTERNAL = 23,       /* 2650-651, 2650-655, 2650-657, 2650-658, 2650-661, 2650-691 */
+    IDM_E_MAPFILE_LOCKED = 30, /* 2650-656 */
+    IDM_E_MAPFILE_ACCESS = 36, /* 2650-653, 2650-654 */
+    IDM_E_RULE = 38,           /* 2650-662 to 2650-667 */
+
+    /* Translator results with a meaning to the walk (besides IDM_OK): */
+    IDM_TRANSLATOR_STOP = 31,    /* ends the walk at once, with this status */
+    IDM_TRANSLATOR_REJECT = 38,  /* no match; the rule is checked and kept as it stands */
+    IDM_TRANSLATOR_REFUSED = 39  /* the entry is passed over until the map files change */
+};
+
 /* Translator routine of an MPM.
  *   entry != NULL: `rule` arrives zeroed; fill it from the entry (for an
  *                  affirmative entry `mapping` holds the local identity it
  *                  grants) and fill `id` from `network_id`.
  *   entry == NULL: `rule` is a rule cached from an earlier call; fill only
  *                  `id`.
- * Returns 0 when both structures were filled; 31 stops the mapping walk at
- * once; 38 and 39 mark the entry's rule unusable until the map files change;
- * any other status passes the entry over.  The routine may be cancelled at any
+ * Returns IDM_OK when both structures were filled; IDM_TRANSLATOR_STOP
+ * stops the mapping walk at once; IDM_TRANSLATOR_REJECT and
+ * IDM_TRANSLATOR_REFUSED mark the entry's rule unusable until the map files
+ * change; any other status passes the entry over.  The routine may be cancelled at any
  * cancellation point: the library holds no lock that cancellation would
  * leak. */
 typedef int32_t (*idm_translator_routine)(const idm_mapfile_entry *entry, const char *network_id,

@@ -28,7 +28,7 @@
 #include "harness.h"
 #include "test_mpm.h"
 #include "oxidm_clmap.h"
-#include "oxidm_internal.h"
+#include "oxidm_state.h"
 #include "test_cluster_threads.h"
 
 namespace {

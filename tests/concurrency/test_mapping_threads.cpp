@@ -17,7 +17,7 @@
 #include "../unit/test_sweep.h"
 #include "harness.h"
 #include "test_mpm.h"
-#include "oxidm_internal.h"
+#include "oxidm_state.h"
 
 namespace {
 

@@ -19,7 +19,7 @@
 
 #include "harness.h"
 #include "test_mpm.h"
-#include "oxidm_internal.h"
+#include "oxidm_state.h"
 #include "oxidm_natfile.h"
 
 #if defined(__SANITIZE_ADDRESS__)

@@ -33,7 +33,7 @@
 #include "harness.h"
 #include "test_mpm.h"
 #include "oxidm_clmap.h"
-#include "oxidm_internal.h"
+#include "oxidm_state.h"
 
 namespace {
 

@@ -14,7 +14,7 @@
 #include "../unit/test_sweep.h"
 #include "groups_db.h"
 #include "oxidm.h"
-#include "oxidm_internal.h"
+#include "oxidm_state.h"
 
 namespace {
 

@@ -11,7 +11,7 @@
 
 #include "harness.h"
 #include "oxidm_clmap.h"
-#include "oxidm_internal.h"
+#include "oxidm_state.h"
 
 namespace {
 

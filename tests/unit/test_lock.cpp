@@ -4,7 +4,7 @@
 #include <cstring>
 
 #include "harness.h"
-#include "oxidm_internal.h"
+#include "oxidm_state.h"
 #include "oxsec_lock.h"
 
 namespace {

@@ -15,7 +15,7 @@
 
 #include "harness.h"
 #include "test_mpm.h"
-#include "oxidm_internal.h"
+#include "oxidm_state.h"
 #include "oxidm_natfile.h"
 
 // The stream opening of the library is reached through this definition in

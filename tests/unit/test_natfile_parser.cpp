@@ -8,7 +8,7 @@
 #include <vector>
 
 #include "harness.h"
-#include "oxidm_internal.h"
+#include "oxidm_state.h"
 #include "oxidm_natfile.h"
 
 namespace {

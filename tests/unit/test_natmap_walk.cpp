@@ -15,7 +15,7 @@
 #include <vector>
 
 #include "harness.h"
-#include "oxidm_internal.h"
+#include "oxidm_state.h"
 #include "oxidm_natmap.h"
 
 namespace {

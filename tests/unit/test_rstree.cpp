@@ -7,7 +7,7 @@
 #include <vector>
 
 #include "harness.h"
-#include "oxidm_internal.h"
+#include "oxidm_state.h"
 #include "oxsec_rstree.h"
 
 namespace {

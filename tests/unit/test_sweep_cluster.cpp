@@ -5,7 +5,7 @@
 #include <vector>
 
 #include "oxidm_clmap.h"
-#include "oxidm_internal.h"
+#include "oxidm_state.h"
 #include "test_sweep.h"
 
 namespace {

@@ -7,7 +7,7 @@
 #include <string>
 #include <vector>
 
-#include "oxidm_internal.h"
+#include "oxidm_state.h"
 #include "oxidm_natfile.h"
 #include "test_sweep.h"
 

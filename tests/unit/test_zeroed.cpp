@@ -22,7 +22,7 @@
 #include <vector>
 
 #include "harness.h"
-#include "oxidm_internal.h"
+#include "oxidm_state.h"
 #include "oxidm_natfile.h"
 #include "oxidm_natmap.h"
 

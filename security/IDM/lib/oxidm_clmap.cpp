@@ -28,7 +28,9 @@
 #include <cctype>
 #include <memory>
 
-#include "oxidm_internal.h"
+#include "oxidm_diag.h"
+#include "oxidm_holds.h"
+#include "oxidm_state.h"
 
 using namespace idm;
 
@@ -439,7 +441,7 @@ class Builder {
             if (lists_[a].values == nullptr) {
                 report_no_memory("idm__construct_clcfg", kListStep * sizeof(char *));
                 trace_alloc_failure(kSites[a], kListStep * sizeof(char *));
-                return 6;
+                return kNoMemory;
             }
             lists_[a].capacity = kListStep;
         }
@@ -460,7 +462,7 @@ class Builder {
     // The value extraction reports the end of a blank-separated list as an
     // invalid entry; the parse takes it for the list's end, so a load that
     // succeeds leaves this report behind as the current error.
-    static void on_list_end(void *) { report(21, kMsg690); }
+    static void on_list_end(void *) { report(kNodeFileInvalid, kMsg690); }
     static int32_t on_value(void *self, Attr attr, std::string_view value) {
         return static_cast<Builder *>(self)->add_value(attr, value);
     }
@@ -469,7 +471,7 @@ class Builder {
     int32_t add_value(Attr attr, std::string_view value) {
         WorkList &l = lists_[attr];
         char *copy = copy_value(value.data(), value.size());
-        if (copy == nullptr) return 6;
+        if (copy == nullptr) return kNoMemory;
         l.values[l.count++] = copy;
         if (l.count == l.capacity) return grow(attr);
         return 0;
@@ -484,7 +486,7 @@ class Builder {
         if (grown == nullptr) {
             report_no_memory("idm__construct_clcfg", bytes);
             trace_alloc_failure(kSites[attr], bytes);
-            return 6;
+            return kNoMemory;
         }
         std::memset(grown + l.capacity, 0, kListStep * sizeof(char *));
         l.values = grown;
@@ -524,14 +526,14 @@ class Builder {
             if (make_node(key, cluster_bytes, &node) != 0) {
                 if (trace::diag_on())
                     trace::record_data(tp::kNodeNoTreeRecord, trace::text(label), trace::text(*key != '\0' ? key : kNullValue));
-                return 6;
+                return kNoMemory;
             }
             void *item = node;
             const int r = sec__rst_insert(tree, &item);
             if (r < 0) {
                 idm__rtree_cleanup_routine(node);
                 if (trace::error_on()) trace::record_data(tp::kTreeInsertFailed, trace::text(label));
-                return report(23, kMsg691);
+                return report(kInternal, kMsg691);
             }
             if (r == 0) idm__rtree_cleanup_routine(node);
         }
@@ -600,7 +602,7 @@ int32_t read_whole(int fd, size_t expected, Text &text, bool &grew) {
         if (got == 0) break;
         if (got < 0) {
             if (errno == EINTR) continue;
-            return report(21, kMsg694);
+            return report(kNodeFileInvalid, kMsg694);
         }
         if (full) {
             // More than its size at the open: the file grew, or it never
@@ -638,17 +640,17 @@ int32_t load(MapHold &hold) {
     struct stat st;
     for (;;) {
         if (::stat(kNodeInfoPath, &st) != 0) {
-            if (errno != ENOENT) return report(21, kMsg692);
+            if (errno != ENOENT) return report(kNodeFileInvalid, kMsg692);
             // A symbolic link to nothing is a file that cannot be read, not
             // a missing one.
-            if (::lstat(kNodeInfoPath, &st) == 0) return report(21, kMsg693);
+            if (::lstat(kNodeInfoPath, &st) == 0) return report(kNodeFileInvalid, kMsg693);
             empty_trees(hold);
             return 0;
         }
         // Anything but a regular file (a FIFO, a device, a directory, a
         // socket) is a file that cannot be read, reported at every query
         // until it is replaced; it is never opened.
-        if (!S_ISREG(st.st_mode)) return report(21, kMsg693);
+        if (!S_ISREG(st.st_mode)) return report(kNodeFileInvalid, kMsg693);
         if (st.st_size == 0) {
             empty_trees(hold);
             if (st.st_mtime != load_lastmod()) {
@@ -670,23 +672,23 @@ int32_t load(MapHold &hold) {
     Text text;
     for (int attempt = 1;; ++attempt) {
         FileHold file(open_uncancelled(kNodeInfoPath));
-        if (file.fd() < 0) return claim.finish(report(21, kMsg693));
+        if (file.fd() < 0) return claim.finish(report(kNodeFileInvalid, kMsg693));
         const FileStamp before = stamp_of(file.fd());
         // Replaced by something else since the stat: looked at again.
-        if (!before.regular) return claim.retry(report(21, kMsg693));
+        if (!before.regular) return claim.retry(report(kNodeFileInvalid, kMsg693));
         bool grew = false;
         if (int32_t status = read_whole(file.fd(), static_cast<size_t>(before.size), text, grew); status != 0)
             return claim.finish(status);
         const FileStamp after = stamp_of(file.fd());
         const bool steady = after == before;
         file.close();
-        if (steady && grew) return claim.retry(report(21, kMsg694));
+        if (steady && grew) return claim.retry(report(kNodeFileInvalid, kMsg694));
         if (steady) {
             // A cut last line is not acted on: the trees stay as they were.
             if (cut_line(text, after)) return claim.retry();
             break;
         }
-        if (attempt == kReadAttempts) return claim.retry(report(21, kMsg694));
+        if (attempt == kReadAttempts) return claim.retry(report(kNodeFileInvalid, kMsg694));
     }
     return claim.finish(idm__construct_clcfg(hold, text.bytes.get(), text.size + 1));
 }
@@ -753,9 +755,9 @@ int32_t idm__construct_clcfg(MapHold &hold, const char *text, size_t size) {
         if (status == 0) {
             const idm::clmap::ParseSink sink = builder.sink();
             const idm::clmap::ParseResult r = idm::clmap::parse(std::string_view(text, size), sink);
-            if (r.status == 21) {
+            if (r.status == kNodeFileInvalid) {
                 if (trace::error_on()) trace::record_id(r.point);
-                report(21, kMsg690);
+                report(kNodeFileInvalid, kMsg690);
             }
             status = r.status;
             if (status != 0) idm::clmap::clean_trees();
@@ -799,16 +801,16 @@ extern "C" {
 
 int32_t idm__extract_attr_value(const char *text, int32_t *consumed, char **attr_value, char terminator) {
     static constexpr const char kName[] = "idm__extract_attr_value";
-    if (text == nullptr) return report_bad_internal_param(23, kName, 1, hex(text));
-    if (consumed == nullptr) return report_bad_internal_param(23, kName, 2, hex(consumed));
-    if (attr_value == nullptr) return report_bad_internal_param(23, kName, 3, hex(attr_value));
+    if (text == nullptr) return report_bad_internal_param(kInternal, kName, 1, hex(text));
+    if (consumed == nullptr) return report_bad_internal_param(kInternal, kName, 2, hex(consumed));
+    if (attr_value == nullptr) return report_bad_internal_param(kInternal, kName, 3, hex(attr_value));
     *attr_value = nullptr;
     // The value ends at the terminator or at the line's LF at the latest.
     const char *end = static_cast<const char *>(std::strchr(text, '\n'));
     const size_t length = end != nullptr ? static_cast<size_t>(end - text) + 1 : std::strlen(text);
     const idm::clmap::ValueScan v = idm::clmap::scan_value(std::string_view(text, length), terminator);
     *consumed = static_cast<int32_t>(v.consumed);
-    if (v.status != 0) return report(21, kMsg690);
+    if (v.status != 0) return report(kNodeFileInvalid, kMsg690);
     if (v.length == 0) return 0;
     *attr_value = idm::clmap::copy_value(text + v.begin, v.length);
     return *attr_value != nullptr ? 0 : 6;
@@ -816,11 +818,11 @@ int32_t idm__extract_attr_value(const char *text, int32_t *consumed, char **attr
 
 int32_t idm__getnode(const char *key, char **clusters, int32_t count, idm_clnode **node) {
     static constexpr const char kName[] = "idm__getnode";
-    if (node == nullptr) return report_bad_internal_param(23, kName, 4, hex(node));
+    if (node == nullptr) return report_bad_internal_param(kInternal, kName, 4, hex(node));
     *node = nullptr;
-    if (key == nullptr) return report_bad_internal_param(23, kName, 1, hex(key));
+    if (key == nullptr) return report_bad_internal_param(kInternal, kName, 1, hex(key));
     if (count < 0 || (count > 0 && clusters == nullptr))
-        return report_bad_internal_param(23, kName, 3, hex(static_cast<uintptr_t>(static_cast<intptr_t>(count))));
+        return report_bad_internal_param(kInternal, kName, 3, hex(static_cast<uintptr_t>(static_cast<intptr_t>(count))));
     auto *n = static_cast<idm_clnode *>(xmalloc(sizeof(idm_clnode)));
     if (n == nullptr) return report_no_memory(kName, sizeof(idm_clnode));
     *n = idm_clnode{nullptr, nullptr, 0};

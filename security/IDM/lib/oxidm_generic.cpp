@@ -1,7 +1,8 @@
 // The exported identity-mapping entry points: argument checks in their fixed
 // order, entry and exit trace points, and dispatch through the service table
 // of idm__state.  These functions hold no lock themselves.
-#include "oxidm_internal.h"
+#include "oxidm_diag.h"
+#include "oxidm_state.h"
 
 using namespace idm;
 
@@ -97,7 +98,7 @@ __attribute__((visibility("default"))) int32_t sec_idm_get_groups(idm_buffer *us
 __attribute__((visibility("default"))) int32_t _sec_idm_get_translator(const char *mnemonic,
                                                                        idm_translator_routine *translator,
                                                                        idm_cleanup_routine *cleanup) {
-    if (translator == nullptr || cleanup == nullptr) return 4;
+    if (translator == nullptr || cleanup == nullptr) return kBadParameter;
     return idm__native_get_translator(mnemonic, translator, cleanup);
 }
 

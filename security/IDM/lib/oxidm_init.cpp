@@ -6,7 +6,7 @@
 // idm__state.mutex is held only inside idm__state_init.  The service table is
 // written once there and read afterwards without a lock (the once-control
 // orders the write before every read).
-#include "oxidm_internal.h"
+#include "oxidm_state.h"
 
 extern "C" {
 

@@ -19,6 +19,8 @@
 // The line check is a pure function (idm::mapfile::judge_line and its parts)
 // that the file walk, the fuzzer and the checker tool share; the walk owns
 // the I/O, the locking and the trace points.
+#include <cerrno>
+
 #include "oxidm_natfile.h"
 
 #include <malloc.h>
@@ -27,7 +29,9 @@
 
 #include <climits>
 
-#include "oxidm_internal.h"
+#include "oxidm_diag.h"
+#include "oxidm_holds.h"
+#include "ox_mss.h"
 
 using namespace idm;
 
@@ -58,7 +62,7 @@ size_t blank_in(std::string_view s, size_t i, size_t end) {
 
 // Reports 2650-651 for an internal routine and records its Error/Diag trace
 // point with the position and the low 32 bits of the value.
-int32_t bad_param(int32_t status, const char *function, trace::tp::Id trace_id, int32_t position, uintptr_t value) {
+int32_t bad_param(Status status, const char *function, trace::tp::Id trace_id, int32_t position, uintptr_t value) {
     if (trace::error_on()) {
         uint32_t low = static_cast<uint32_t>(value);
         trace::record_data(trace_id, trace::i32(position), trace::u32(low));
@@ -70,7 +74,7 @@ uintptr_t addr(const void *p) { return reinterpret_cast<uintptr_t>(p); }
 
 // The result code, in the 2650-655 report of a failed open, of a map file
 // path that names anything but a regular file; libox_mss uses the same.
-constexpr int kNotRegularFile = 22;
+constexpr int kNotRegularFile = kMssNotRegularFile;
 // The code in the 2650-655 report of a file that kept changing while it was
 // read (EAGAIN).
 constexpr int kKeptChanging = 11;
@@ -348,7 +352,7 @@ int32_t idm__native_get_mapfile_names(idm_mapfile_set **set_out) {
         return status;
     };
 
-    if (set_out == nullptr) return leave(bad_param(23, kName, tp::kMapfileNamesBadArg, 1, 0), nullptr);
+    if (set_out == nullptr) return leave(bad_param(kInternal, kName, tp::kMapfileNamesBadArg, 1, 0), nullptr);
 
     auto no_memory = [&](int site, size_t bytes) {
         if (trace::error_on()) {
@@ -418,7 +422,7 @@ int32_t idm__ready_mapfile(const char *path, int32_t *fd, FILE **stream) {
     };
     auto bad = [&](int32_t position, uintptr_t value) {
         if (trace::error_on()) trace::record_data(tp::kReadyBadArg, trace::i32(position));
-        return leave(report_bad_internal_param(23, kName, position, hex(value)));
+        return leave(report_bad_internal_param(kInternal, kName, position, hex(value)));
     };
     if (path == nullptr || path[0] == '\0') return bad(1, addr(path));
     if (fd == nullptr) return bad(2, 0);
@@ -442,11 +446,11 @@ int32_t idm__ready_mapfile(const char *path, int32_t *fd, FILE **stream) {
     }
     if (trace::diag_on()) trace::record_data(tp::kReadyOpened, trace::text(path), trace::i32(r), trace::i32(d));
     switch (r) {
-    case 0: break;
-    case 12: d = -1; return leave(report(36, kMsg653, kName, path));
-    case 21: d = -1; return leave(37);
-    case 6: d = -1; return leave(report(36, kMsg654, kName, 0));
-    default: d = -1; return leave(report(23, kMsg655, "idm__open_mapfile", r, kName));
+    case kMssOk: break;
+    case kMssAccessDenied: d = -1; return leave(report(kMapfileInaccessible, kMsg653, kName, path));
+    case kMssMissing: d = -1; return leave(kMapfileMissing);
+    case kMssNoMemory: d = -1; return leave(report(kMapfileInaccessible, kMsg654, kName, 0));
+    default: d = -1; return leave(report(kInternal, kMsg655, "idm__open_mapfile", r, kName));
     }
 
     r = sec__readlock_file(d, kName);
@@ -454,8 +458,8 @@ int32_t idm__ready_mapfile(const char *path, int32_t *fd, FILE **stream) {
     if (r != 0) {
         hold.close();
         d = -1;
-        if (r == 30) return leave(report(30, kMsg656, "idm__readlock_mapfile", path));
-        return leave(report(23, kMsg655, "idm__readlock_mapfile", r, kName));
+        if (r == kMssLockTimeout) return leave(report(kMapfileLocked, kMsg656, "idm__readlock_mapfile", path));
+        return leave(report(kInternal, kMsg655, "idm__readlock_mapfile", r, kName));
     }
     hold.locked();
 
@@ -467,7 +471,7 @@ int32_t idm__ready_mapfile(const char *path, int32_t *fd, FILE **stream) {
         hold.close();
         if (trace::diag_on()) trace::record_data(tp::kReadyNoStream, trace::text(path), trace::i32(e), trace::ptr(s));
         d = -1;
-        return leave(report(23, kMsg657, path, number, e));
+        return leave(report(kInternal, kMsg657, path, number, e));
     }
     if (trace::diag_on()) trace::record_id(tp::kReadyStream);
     // The stream is this thread's alone: no stdio locking per line.
@@ -504,11 +508,11 @@ int32_t parse_mapfile(const char *mechanism, const char *path, FILE *stream, int
         count_now = count != nullptr ? *count : 0;
         return api.leave(status, trace::i32(count_now), trace::ptr(entries));
     };
-    if (mechanism == nullptr || mechanism[0] == '\0') return leave(bad_param(23, kName, tp::kParseBadArg, 1, addr(mechanism)));
-    if (path == nullptr || path[0] == '\0') return leave(bad_param(23, kName, tp::kParseBadArg, 2, addr(path)));
-    if (stream == nullptr) return leave(bad_param(23, kName, tp::kParseBadArg, 3, 0));
-    if (count == nullptr) return leave(bad_param(23, kName, tp::kParseBadArg, 4, 0));
-    if (entries == nullptr) return leave(bad_param(23, kName, tp::kParseBadArg, 5, 0));
+    if (mechanism == nullptr || mechanism[0] == '\0') return leave(bad_param(kInternal, kName, tp::kParseBadArg, 1, addr(mechanism)));
+    if (path == nullptr || path[0] == '\0') return leave(bad_param(kInternal, kName, tp::kParseBadArg, 2, addr(path)));
+    if (stream == nullptr) return leave(bad_param(kInternal, kName, tp::kParseBadArg, 3, 0));
+    if (count == nullptr) return leave(bad_param(kInternal, kName, tp::kParseBadArg, 4, 0));
+    if (entries == nullptr) return leave(bad_param(kInternal, kName, tp::kParseBadArg, 5, 0));
 
     if (trace::diag_on()) trace::record_data(tp::kParseFile, trace::text(path), trace::text(mechanism));
     const std::string_view selector(mechanism);
@@ -565,7 +569,7 @@ int32_t parse_mapfile(const char *mechanism, const char *path, FILE *stream, int
     explicit_bzero(piece, sizeof piece);  // the last line read
     // A read error is no end of file: the file's remaining lines, denials
     // among them, were never seen, so the whole pass fails.
-    if (status == 0 && read_error != 0) status = report(23, kMsg655, "fgets", read_error, kName);
+    if (status == 0 && read_error != 0) status = report(kInternal, kMsg655, "fgets", read_error, kName);
     if (trace::diag_on()) trace::record_id(tp::kParseEnd);
     return leave(status);
 }
@@ -590,11 +594,11 @@ int32_t idm__read_mapfile_entries(const char *line, int32_t *count, idm_mapfile_
     int32_t count_now = count != nullptr ? *count : 0;
     trace::Api api(kIds, trace::text(line, "<null string>"), trace::i32(count_now), trace::ptr(entries));
     auto leave = [&](int32_t status) { return api.leave(status, trace::ptr(entries)); };
-    if (line == nullptr || line[0] == '\0') return leave(bad_param(23, kName, tp::kEntriesBadArg, 1, addr(line)));
-    if (count == nullptr) return leave(bad_param(23, kName, tp::kEntriesBadArg, 2, 0));
-    if (*count < 0) return leave(bad_param(23, kName, tp::kEntriesBadArg, 2, static_cast<uint32_t>(*count)));
+    if (line == nullptr || line[0] == '\0') return leave(bad_param(kInternal, kName, tp::kEntriesBadArg, 1, addr(line)));
+    if (count == nullptr) return leave(bad_param(kInternal, kName, tp::kEntriesBadArg, 2, 0));
+    if (*count < 0) return leave(bad_param(kInternal, kName, tp::kEntriesBadArg, 2, static_cast<uint32_t>(*count)));
     if (entries == nullptr || (*count == 0 && *entries != nullptr))
-        return leave(bad_param(23, kName, tp::kEntriesBadArg, 3, addr(entries)));
+        return leave(bad_param(kInternal, kName, tp::kEntriesBadArg, 3, addr(entries)));
 
     mapfile::LineVerdict v = mapfile::judge_rule(line);
     if (v.kind != mapfile::LineKind::kAffirmative && v.kind != mapfile::LineKind::kDenial) {
@@ -606,7 +610,7 @@ int32_t idm__read_mapfile_entries(const char *line, int32_t *count, idm_mapfile_
     auto no_memory = [&](trace::tp::Id trace_id, size_t bytes) {
         int32_t b = static_cast<int32_t>(bytes);
         if (trace::error_on()) trace::record_data(trace_id, trace::i32(b));
-        return leave(report(23, kMsg658, kName, b));
+        return leave(report(kInternal, kMsg658, kName, b));
     };
     SecretCopy network, local;
     if (!network.make(v.network_id)) return no_memory(tp::kEntriesNoNetworkCopy, v.network_id.size() + 1);
@@ -630,8 +634,8 @@ int32_t idm__read_mapfile_entries(const char *line, int32_t *count, idm_mapfile_
 }
 
 int32_t idm__alloc_entries(int32_t count, idm_mapfile_entry **entries) {
-    if (count < 0) return bad_param(23, "idm__alloc_entries", tp::kEntriesBadArg, 1, static_cast<uint32_t>(count));
-    if (entries == nullptr) return bad_param(23, "idm__alloc_entries", tp::kEntriesBadArg, 2, 0);
+    if (count < 0) return bad_param(kInternal, "idm__alloc_entries", tp::kEntriesBadArg, 1, static_cast<uint32_t>(count));
+    if (entries == nullptr) return bad_param(kInternal, "idm__alloc_entries", tp::kEntriesBadArg, 2, 0);
     if (count % 10 != 0) return 0;
     // The list grows by ten slots: every tenth entry is one enlargement,
     // with its own failure point and the size of count + 10 entries.  The
@@ -661,8 +665,8 @@ int32_t idm__alloc_entries(int32_t count, idm_mapfile_entry **entries) {
     }
     if (!grown) {
         if (trace::error_on()) trace::record_data(tp::kEntriesGrowFailed, trace::i32(bytes32));
-        report(23, kMsg658, "idm_alloc_entries", bytes32);
-        return 6;
+        report(kInternal, kMsg658, "idm_alloc_entries", bytes32);
+        return kNoMemory;
     }
     std::memset(array + count, 0, 10 * sizeof(idm_mapfile_entry));
     *entries = array;
@@ -719,16 +723,16 @@ int32_t idm__native_test_mapfiles_v1(idm_mapfile_set *set, int32_t index, int32_
     auto leave = [&api](int32_t result) { return api.leave(result); };
     if (set == nullptr || set->names == nullptr || set->flags == nullptr || set->mtimes == nullptr ||
         set->read_times == nullptr)
-        return leave(report_bad_internal_param(23, kName, 1, hex(set)));
+        return leave(report_bad_internal_param(kInternal, kName, 1, hex(set)));
     if (index < 0 || index >= set->count)
-        return leave(report_bad_internal_param(23, kName, 2, hex(static_cast<uint32_t>(index))));
+        return leave(report_bad_internal_param(kInternal, kName, 2, hex(static_cast<uint32_t>(index))));
     if (superseder < -1 || superseder >= set->count || superseder == index)
-        return leave(report_bad_internal_param(23, kName, 3, hex(static_cast<uint32_t>(superseder))));
+        return leave(report_bad_internal_param(kInternal, kName, 3, hex(static_cast<uint32_t>(superseder))));
 
     const char *path = set->names[index];
     uint32_t m = 0;
     int r = sec__time_file(path, &m);
-    if (r != 0 && r != 21) return r;  // no exit record on a failed query
+    if (r != kMssOk && r != kMssMissing) return r;  // no exit record on a failed query
 
     uint32_t &flags = set->flags[index];
     uint32_t &mtime = set->mtimes[index];
@@ -742,7 +746,7 @@ int32_t idm__native_test_mapfiles_v1(idm_mapfile_set *set, int32_t index, int32_
     };
     const bool superseded = superseder >= 0 && (set->flags[superseder] & MF_PRESENT) != 0;
 
-    if (r == 21) {
+    if (r == kMssMissing) {
         if ((flags & MF_PRESENT) == 0) {  // still absent
             flags &= ~MF_REMOVED;
             note(tp::kTestFileUnchanged);
@@ -814,12 +818,12 @@ int32_t idm__native_test_mapfiles(idm_mapfile_set *set) {
     };
 
     if (set == nullptr) {
-        bad_param(4, kName, tp::kTestFilesBadArg, 1, 0);
+        bad_param(kBadParameter, kName, tp::kTestFilesBadArg, 1, 0);
         return leave(1);
     }
     if (uint32_t version = set->tag & 0xffu; version != IDM_MAPFILE_SET_VERSION) {
         if (trace::error_on()) trace::record_data(tp::kTestFilesBadVersion, trace::u32(version));
-        report(23, kMsg655, kName, 23, "[ignored]");
+        report(kInternal, kMsg655, kName, 23, "[ignored]");
         deselect_all();
         return leave(1);
     }
@@ -904,11 +908,11 @@ int32_t read_one_file(const char *mechanism, const char *path, idm_entry_list &l
         if (status == 0 && outcome.overran && steady) {
             // More text than its unchanged size: no file a writer keeps.
             truncate_list(list, first_entry);
-            return report(23, kMsg655, "idm__parse_mapfile", kNotRegularFile, kName);
+            return report(kInternal, kMsg655, "idm__parse_mapfile", kNotRegularFile, kName);
         }
         if (status != 0 || steady) return status;
         truncate_list(list, first_entry);
-        if (attempt == kReadAttempts) return report(23, kMsg655, "idm__parse_mapfile", kKeptChanging, kName);
+        if (attempt == kReadAttempts) return report(kInternal, kMsg655, "idm__parse_mapfile", kKeptChanging, kName);
     }
 }
 
@@ -930,10 +934,10 @@ int32_t idm__native_read_mapfiles(const char *mechanism, idm_mapfile_set **set, 
 
     EntriesHold building;  // the list this pass builds, freed unless handed over
 
-    if (mechanism == nullptr || mechanism[0] == '\0') return leave(bad_param(23, kName, tp::kReadMapfilesBadArg, 1, addr(mechanism)));
-    if (set == nullptr) return leave(bad_param(23, kName, tp::kReadMapfilesBadArg, 2, 0));
-    if (count == nullptr) return leave(bad_param(23, kName, tp::kReadMapfilesBadArg, 3, 0));
-    if (entries == nullptr) return leave(bad_param(23, kName, tp::kReadMapfilesBadArg, 4, 0));
+    if (mechanism == nullptr || mechanism[0] == '\0') return leave(bad_param(kInternal, kName, tp::kReadMapfilesBadArg, 1, addr(mechanism)));
+    if (set == nullptr) return leave(bad_param(kInternal, kName, tp::kReadMapfilesBadArg, 2, 0));
+    if (count == nullptr) return leave(bad_param(kInternal, kName, tp::kReadMapfilesBadArg, 3, 0));
+    if (entries == nullptr) return leave(bad_param(kInternal, kName, tp::kReadMapfilesBadArg, 4, 0));
     if (trace::level(trace::kApi) == 8 || trace::diag_on())
         trace::record_data(tp::kReadMapfilesArgs, trace::text(mechanism), trace::ptr(set), trace::ptr(*set), trace::ptr(count),
                            trace::i32(*count), trace::ptr(entries), trace::ptr(*entries));

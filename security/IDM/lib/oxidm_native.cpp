@@ -12,7 +12,11 @@
 #include <pwd.h>
 #include <unistd.h>
 
-#include "oxidm_internal.h"
+#include <cerrno>
+
+#include "oxidm_diag.h"
+#include "oxidm_holds.h"
+#include "oxidm_state.h"
 #include "oxidm_natfile.h"
 #include "oxidm_natmap.h"
 
@@ -54,8 +58,8 @@ int32_t idm__native_register_translator(const char *mnemonic, idm_translator_rou
                 status = report_no_memory(kName, sizeof(idm_translator));
             } else if (int r = mutex_init(&created->mutex); r != 0) {
                 if (r == ENOMEM) status = report_no_memory(kName, sizeof(pthread_mutex_t));
-                else if (r == EAGAIN) status = report(23, kMsg661, kName);
-                else status = report(23, kMsg655, "pthread_mutex_init", r, kName);
+                else if (r == EAGAIN) status = report(kInternal, kMsg661, kName);
+                else status = report(kInternal, kMsg655, "pthread_mutex_init", r, kName);
             } else {
                 mutex_made = true;
                 created->mnemonic = xstrdup(mnemonic);
@@ -134,7 +138,7 @@ int32_t idm__native_map_identity(const char *mnemonic, const char *network_id, i
     trace::Api api(kIds, trace::text(mnemonic), trace::text(network_id), trace::ptr(local));
     pthread_once(&idm__native_init_once_block, idm__native_state_init);
     idm_translator *record = idm__native_find_translator(mnemonic);
-    if (record == nullptr) return api.leave(report(22, kMsg660, mnemonic));
+    if (record == nullptr) return api.leave(report(kNoTranslator, kMsg660, mnemonic));
 
     // Refresh.  After a change or a read error the old entries and rules
     // go, and a new list is installed within the same hold.  The old ones
@@ -192,13 +196,13 @@ int32_t idm__native_map_identity(const char *mnemonic, const char *network_id, i
                 case 0:
                     match = idm__native_apply_rule(&rule, &id, local);
                     break;
-                case 39:
+                case kTranslatorRefused:
                     (void)cleanup(&rule, nullptr);
                     rule = idm_rule{};
                     rule.rule_state = IDM_RULE_MULTI_WILDCARD;
                     break;
-                case 38:
-                case 31:
+                case kRuleInvalid:
+                case kTranslatorStop:
                     (void)idm__native_check_rule(&rule);
                     break;
                 default:
@@ -207,7 +211,7 @@ int32_t idm__native_map_identity(const char *mnemonic, const char *network_id, i
                 if (idm__native_cache_rule(record, entry, &rule) == 0) (void)cleanup(nullptr, &id);
                 else (void)cleanup(&rule, &id);
             }
-            if (status == 31 || (status == 0 && match == 0)) break;
+            if (status == kTranslatorStop || (status == kOk && match == 0)) break;
         }
         result.keep();
     }
@@ -337,7 +341,7 @@ int32_t lookup_primary_group(const char *name, size_t pw_size, size_t gr_size, G
     passwd *user = nullptr;
     int result = getpwnam_r(name, &pwd, user_buffer.p, user_buffer.n, &user);
     if (result != 0 || user == nullptr || std::strncmp(pwd.pw_name, name, pw_size) != 0)
-        return report(15, kMsg698, name);
+        return report(kGroupsUnavailable, kMsg698, name);
     if (pwd.pw_gid == static_cast<gid_t>(-1)) return 0;
 
     WorkBuffer group_buffer;
@@ -345,7 +349,7 @@ int32_t lookup_primary_group(const char *name, size_t pw_size, size_t gr_size, G
     group grp;
     group *found = nullptr;
     result = getgrgid_r(pwd.pw_gid, &grp, group_buffer.p, group_buffer.n, &found);
-    if (result != 0 || found == nullptr) return report(15, kMsg699, static_cast<int>(pwd.pw_gid));
+    if (result != 0 || found == nullptr) return report(kGroupsUnavailable, kMsg699, static_cast<int>(pwd.pw_gid));
     list.items = static_cast<idm_buffer *>(xcalloc(1, sizeof(idm_buffer)));
     if (list.items == nullptr) return report_no_memory(kGroupsName, sizeof(idm_buffer));
     size_t length = std::strlen(grp.gr_name) + 1;
@@ -374,7 +378,7 @@ int32_t scan_groups(const char *name, size_t gr_size, bool primary, GroupList &l
         if (result != 0) {
             int error = enumeration_error(result);
             if (error == EINTR) continue;
-            if (error != 0 && error != ENOENT) status = report(15, kMsg700, error);
+            if (error != 0 && error != ENOENT) status = report(kGroupsUnavailable, kMsg700, error);
             break;
         }
         if (found == nullptr) break;

@@ -10,7 +10,9 @@
 
 #include <algorithm>
 
-#include "oxidm_internal.h"
+#include "oxidm_diag.h"
+#include "oxidm_holds.h"
+#include "oxidm_state.h"
 
 using namespace idm;
 
@@ -124,7 +126,7 @@ int32_t idm__strncmpr(const char *s1, const char *s2, uint32_t n) {
 int32_t idm__native_match_rgy(const char *rule_rgy, const char *id_rgy) {
     // Both are non-empty after the checks; a null one simply does not match.
     if (rule_rgy == nullptr || id_rgy == nullptr || !wildcard_match(rule_rgy, id_rgy))
-        return report(38, kMsg667, rule_rgy != nullptr ? rule_rgy : "", id_rgy != nullptr ? id_rgy : "");
+        return report(kRuleInvalid, kMsg667, rule_rgy != nullptr ? rule_rgy : "", id_rgy != nullptr ? id_rgy : "");
     return 0;
 }
 
@@ -132,7 +134,7 @@ int32_t idm__native_match_token(const char *rule_token, const char *id_token) {
     static constexpr const char kName[] = "idm__native_match_token";
     if (!nonempty(rule_token)) return report_bad_param(kName, 1, hex(rule_token));
     if (!nonempty(id_token)) return report_bad_param(kName, 2, hex(id_token));
-    if (!wildcard_match(rule_token, id_token)) return report(38, kMsg666, rule_token, id_token);
+    if (!wildcard_match(rule_token, id_token)) return report(kRuleInvalid, kMsg666, rule_token, id_token);
     return 0;
 }
 
@@ -204,7 +206,7 @@ int32_t idm__native_check_rule(idm_rule *rule) {
             }
         }
     }
-    return api.leave(report(38, kMsg662));
+    return api.leave(report(kRuleInvalid, kMsg662));
 }
 
 int32_t idm__native_check_id(idm_id *id) {
@@ -213,7 +215,7 @@ int32_t idm__native_check_id(idm_id *id) {
     if (api.entered_with_data()) idm__trace_native_id(id);
     int32_t status = 0;
     if (!nonempty(id->rgy_type) || !nonempty(id->rgy) || id->token_cnt <= 0 || id->tokens == nullptr)
-        status = report(38, kMsg665);
+        status = report(kRuleInvalid, kMsg665);
     return api.leave(status);
 }
 
@@ -232,7 +234,7 @@ int32_t idm__native_get_mapping(idm_rule *rule, idm_id *id, idm_buffer *result) 
         // Only a rule checked against an id of the same token count gets
         // here; a position past the id's tokens is a count mismatch.
         if (id->tokens == nullptr || static_cast<int64_t>(k) > id->token_cnt)
-            return report(38, kMsg664, static_cast<int>(rule->token_cnt), static_cast<int>(id->token_cnt));
+            return report(kRuleInvalid, kMsg664, static_cast<int>(rule->token_cnt), static_cast<int>(id->token_cnt));
         name = id->tokens[k - 1];
         length = static_cast<uint32_t>(std::strlen(name) + 1);
     } else {
@@ -253,8 +255,8 @@ int32_t idm__native_apply_rule(idm_rule *rule, idm_id *id, idm_buffer *result) {
     if (int32_t s = idm__native_check_rule(rule); s != 0) return api.leave(s);
     if (int32_t s = idm__native_check_id(id); s != 0) return api.leave(s);
     if (rule->token_cnt != id->token_cnt)
-        return api.leave(report(38, kMsg664, static_cast<int>(rule->token_cnt), static_cast<int>(id->token_cnt)));
-    if (!same_text(rule->rgy_type, id->rgy_type)) return api.leave(report(38, kMsg663));
+        return api.leave(report(kRuleInvalid, kMsg664, static_cast<int>(rule->token_cnt), static_cast<int>(id->token_cnt)));
+    if (!same_text(rule->rgy_type, id->rgy_type)) return api.leave(report(kRuleInvalid, kMsg663));
     if (int32_t s = idm__native_match_rgy(rule->rgy, id->rgy); s != 0) return api.leave(s);
     for (int32_t i = 0; i < rule->token_cnt; ++i)
         if (int32_t s = idm__native_match_token(rule->tokens[i], id->tokens[i]); s != 0) return api.leave(s);

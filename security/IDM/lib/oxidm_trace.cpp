@@ -5,7 +5,7 @@
 // point), idm__trace_categories and null_string (constant in practice).
 // Registration runs once per process under idm__trace_register_once; the
 // component is never unregistered by the library.
-#include "oxidm_internal.h"
+#include "oxidm_diag.h"
 
 using namespace idm;
 

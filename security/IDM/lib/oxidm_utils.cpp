@@ -2,7 +2,10 @@
 // of texts, zeroing frees, the mutex clean-up handler.  In the
 // fault-injection build (tests only) this module also owns the counters that
 // make the n-th allocation or a mutex initialisation fail.
-#include "oxidm_internal.h"
+#include <strings.h>
+#include <cstring>
+
+#include "oxidm_holds.h"
 
 #include <sys/stat.h>
 

@@ -9,7 +9,7 @@
 
 #include <cstring>
 
-#include "oxidm_internal.h"
+#include "oxidm_holds.h"
 
 namespace {
 

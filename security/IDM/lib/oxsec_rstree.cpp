@@ -13,7 +13,7 @@
 #include <cstdlib>
 #include <ctime>
 
-#include "oxidm_internal.h"
+#include "oxidm_holds.h"
 
 namespace {
 
