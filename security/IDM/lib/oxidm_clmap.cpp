@@ -65,23 +65,15 @@ void store_lastmod(int64_t t) { __atomic_store_n(&lastmod, t, __ATOMIC_RELEASE);
 // trees the load has not rebuilt.  Written under g_outcome_mutex, with a
 // broadcast of g_outcome; read atomically without it.
 int64_t loadedmod = 0;
-pthread_mutex_t g_outcome_mutex = PTHREAD_MUTEX_INITIALIZER;
+idm_mutex_t g_outcome_mutex = PTHREAD_MUTEX_INITIALIZER;
 pthread_cond_t g_outcome = PTHREAD_COND_INITIALIZER;
 
 int64_t load_loadedmod() { return __atomic_load_n(&loadedmod, __ATOMIC_ACQUIRE); }
 
-class OutcomeLock {
-  public:
-    OutcomeLock() { pthread_mutex_lock(&g_outcome_mutex); }
-    ~OutcomeLock() { pthread_mutex_unlock(&g_outcome_mutex); }
-    OutcomeLock(const OutcomeLock &) = delete;
-    OutcomeLock &operator=(const OutcomeLock &) = delete;
-};
-
 // The load that claimed `t` has ended.  A later claim (another time, or a
 // forced reload) keeps its waiters waiting for its own outcome.
 void finish_load(int64_t t) {
-    OutcomeLock lock;
+    MutexHold lock(&g_outcome_mutex);
     if (load_lastmod() == t) __atomic_store_n(&loadedmod, t, __ATOMIC_RELEASE);
     pthread_cond_broadcast(&g_outcome);
 }
@@ -128,12 +120,10 @@ void clean_trees() {
 // taken straight from those freed pieces would be scattered likewise,
 // making every later walk of the trees slower (a steady stream of 100,000-
 // host reloads ran more than twice as long that way).
-class OldTrees {
+class OldTrees : Pinned {
   public:
     OldTrees() = default;
     ~OldTrees() { release(); }
-    OldTrees(const OldTrees &) = delete;
-    OldTrees &operator=(const OldTrees &) = delete;
 
     // Caller holds the write hold.
     void take() {
@@ -164,7 +154,7 @@ int open_uncancelled(const char *path) {
 }
 
 // The descriptor of the file being read; closed at the end of the scope.
-class FileHold {
+class FileHold : Pinned {
   public:
     explicit FileHold(int fd) : fd_(fd) {}
     ~FileHold() { idm::forget_dead_frames(); close(); }
@@ -178,8 +168,6 @@ class FileHold {
         fd_ = -1;
         ::close(fd);
     }
-    FileHold(const FileHold &) = delete;
-    FileHold &operator=(const FileHold &) = delete;
 
   private:
     int fd_;
@@ -190,7 +178,7 @@ class FileHold {
 // finished (the trees are as this load leaves them; the time is not loaded
 // again) or retried (lastmod no longer names a time, so the next query loads
 // the file again).  A cancelled load is retried.
-class LoadClaim {
+class LoadClaim : Pinned {
   public:
     explicit LoadClaim(int64_t t) : time_(t) { store_lastmod(t); }
     ~LoadClaim() {
@@ -207,8 +195,6 @@ class LoadClaim {
         announce_load_outcome();
         return status;
     }
-    LoadClaim(const LoadClaim &) = delete;
-    LoadClaim &operator=(const LoadClaim &) = delete;
 
   private:
     int64_t time_;
@@ -417,7 +403,7 @@ struct WorkList {
 // The parse's sink while loading: the three working lists and the record
 // store.  Owns the lists and every value still in them; the destructor (also
 // the cancellation clean-up) releases them.
-class Builder {
+class Builder : Pinned {
   public:
     // Storing records may make at most this many bytes of tree records per
     // byte of text (plus a fixed allowance): each record gets its own copy of
@@ -430,8 +416,6 @@ class Builder {
     explicit Builder(size_t text_size)
         : record_budget_(text_size * kRecordBytesPerTextByte + kRecordBytesAllowance) {}
     ~Builder() { release(); }
-    Builder(const Builder &) = delete;
-    Builder &operator=(const Builder &) = delete;
 
     // 0, or 6 after reporting (2650-654 and trace point kNodeNoMemory).
     int32_t allocate_lists() {
@@ -716,9 +700,9 @@ void MapHold::wait_for_load(int64_t t) {
     mode_ = kNone;
     sec__unlock_read(lock_);
     {
-        OutcomeLock lock;
+        MutexHold lock(&g_outcome_mutex);
         // A cancellation in the wait re-takes the mutex and unwinds through
-        // OutcomeLock, which releases it; nothing else is held here.
+        // the hold, which releases it; nothing else is held here.
         while (load_lastmod() == t && load_loadedmod() != t) pthread_cond_wait(&g_outcome, &g_outcome_mutex);
     }
     sec__lock_read(lock_);
@@ -732,7 +716,7 @@ void MapHold::demote() {
 }
 
 void announce_load_outcome() {
-    OutcomeLock lock;
+    MutexHold lock(&g_outcome_mutex);
     pthread_cond_broadcast(&g_outcome);
 }
 

@@ -43,6 +43,7 @@
 #include <cstdint>
 #include <string_view>
 
+#include "oxidm_holds.h"
 #include "oxidm_tracepoints.h"
 #include "oxsec_lock.h"
 #include "oxsec_rstree.h"
@@ -66,7 +67,7 @@ inline constexpr int32_t kNotFound = 1;  // host not listed: no failure, nothing
 // waits, since both give up the previous hold first.  The destructor
 // releases whatever is held at that moment, so a query cancelled anywhere
 // (in a lock wait, in open or read) leaves idmutex consistent.
-class MapHold {
+class MapHold : idm::Pinned {
   public:
     explicit MapHold(sec_rwlock *lock);
     ~MapHold();
@@ -75,8 +76,6 @@ class MapHold {
     // Gives up the read share until the load that claimed time `t` has
     // ended (or another claim replaced it), then takes a share again.
     void wait_for_load(int64_t t);
-    MapHold(const MapHold &) = delete;
-    MapHold &operator=(const MapHold &) = delete;
 
   private:
     enum Mode { kNone, kRead, kWrite };

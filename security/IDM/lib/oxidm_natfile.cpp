@@ -100,48 +100,14 @@ bool changed_lately(const FileStamp &stamp) {
 // Holds; each destructor is one of the named cancellation clean-ups
 // ---------------------------------------------------------------------------
 
-// A map file set being built; released unless handed over.
-class SetHold {
-  public:
-    SetHold() = default;
-    ~SetHold() {
-        idm::forget_dead_frames();
-        if (set_ != nullptr) idm__thread_cleanup_cachef(set_);
-    }
-    void hold(idm_mapfile_set *set) { set_ = set; }
-    idm_mapfile_set *release() {
-        idm_mapfile_set *s = set_;
-        set_ = nullptr;
-        return s;
-    }
-    SetHold(const SetHold &) = delete;
-    SetHold &operator=(const SetHold &) = delete;
-
-  private:
-    idm_mapfile_set *set_ = nullptr;
-};
-
-// The entry list of a reading pass; freed unless handed over.
-class EntriesHold {
-  public:
-    EntriesHold() = default;
-    ~EntriesHold() {
-        idm::forget_dead_frames();
-        if (armed_) idm__thread_cleanup_entries(&list_);
-    }
-    idm_entry_list &list() { return list_; }
-    void disarm() { armed_ = false; }
-    EntriesHold(const EntriesHold &) = delete;
-    EntriesHold &operator=(const EntriesHold &) = delete;
-
-  private:
-    idm_entry_list list_{nullptr, 0};
-    bool armed_ = true;
-};
+// A map file set being built, and the entry list of a reading pass: each
+// released unless handed over.
+using SetHold = Hold<idm_mapfile_set, idm__thread_cleanup_cachef>;
+using EntriesHold = Hold<idm_entry_list, idm__thread_cleanup_entries>;
 
 // One open map file of a reading pass; unlocked and closed unless the pass
 // released it itself.
-class MapfileHold {
+class MapfileHold : Pinned {
   public:
     explicit MapfileHold(const char *path) {
         std::memset(&file_, 0, sizeof file_);
@@ -163,8 +129,6 @@ class MapfileHold {
     // buffer that stdio would allocate holds the file's identities and is
     // freed by fclose without being cleared.
     void buffer_stream() { setvbuf(file_.stream, buffer_, _IOFBF, sizeof buffer_); }
-    MapfileHold(const MapfileHold &) = delete;
-    MapfileHold &operator=(const MapfileHold &) = delete;
 
   private:
     idm_open_mapfile file_;
@@ -175,7 +139,7 @@ class MapfileHold {
 // The descriptor inside idm__ready_mapfile until it is handed to the caller:
 // closed (and unlocked once locked) on every other way out, including a
 // cancellation during the lock wait.
-class DescriptorHold {
+class DescriptorHold : Pinned {
   public:
     DescriptorHold() = default;
     ~DescriptorHold() { idm::forget_dead_frames(); close(); }
@@ -193,38 +157,22 @@ class DescriptorHold {
         sec__close_file(&fd);
     }
     void release() { fd_ = -1; }
-    DescriptorHold(const DescriptorHold &) = delete;
-    DescriptorHold &operator=(const DescriptorHold &) = delete;
 
   private:
     int32_t fd_ = -1;
     bool locked_ = false;
 };
 
-// A heap copy of an identifier until it is stored in an entry.
-class SecretCopy {
-  public:
-    SecretCopy() = default;
-    ~SecretCopy() { free_secret(p_); }
-    bool make(std::string_view s) {
-        p_ = static_cast<char *>(xmalloc(s.size() + 1));
-        if (p_ == nullptr) return false;
-        std::memcpy(p_, s.data(), s.size());
-        p_[s.size()] = '\0';
-        return true;
-    }
-    char *get() const { return p_; }
-    char *release() {
-        char *p = p_;
-        p_ = nullptr;
-        return p;
-    }
-    SecretCopy(const SecretCopy &) = delete;
-    SecretCopy &operator=(const SecretCopy &) = delete;
-
-  private:
-    char *p_ = nullptr;
-};
+// A heap copy of an identifier, zeroed and freed unless it is stored in an
+// entry.
+using SecretCopy = Hold<char, free_secret>;
+char *secret_copy(std::string_view s) {
+    auto *p = static_cast<char *>(xmalloc(s.size() + 1));
+    if (p == nullptr) return nullptr;
+    std::memcpy(p, s.data(), s.size());
+    p[s.size()] = '\0';
+    return p;
+}
 
 // ---------------------------------------------------------------------------
 // Candidate files
@@ -612,9 +560,10 @@ int32_t idm__read_mapfile_entries(const char *line, int32_t *count, idm_mapfile_
         if (trace::error_on()) trace::record_data(trace_id, trace::i32(b));
         return leave(report(kInternal, kMsg658, kName, b));
     };
-    SecretCopy network, local;
-    if (!network.make(v.network_id)) return no_memory(tp::kEntriesNoNetworkCopy, v.network_id.size() + 1);
-    if (!denial && !local.make(v.local_id)) return no_memory(tp::kEntriesNoLocalCopy, v.local_id.size() + 1);
+    SecretCopy network(secret_copy(v.network_id));
+    if (network.get() == nullptr) return no_memory(tp::kEntriesNoNetworkCopy, v.network_id.size() + 1);
+    SecretCopy local(denial ? nullptr : secret_copy(v.local_id));
+    if (!denial && local.get() == nullptr) return no_memory(tp::kEntriesNoLocalCopy, v.local_id.size() + 1);
 
     if (int32_t status = idm__alloc_entries(*count, entries); status != 0) return leave(status);
 
@@ -932,7 +881,8 @@ int32_t idm__native_read_mapfiles(const char *mechanism, idm_mapfile_set **set, 
         return api.leave(status, trace::ptr(set), trace::ptr(s), trace::ptr(count), trace::i32(c), trace::ptr(entries));
     };
 
-    EntriesHold building;  // the list this pass builds, freed unless handed over
+    idm_entry_list list{nullptr, 0};  // the list this pass builds, freed unless handed over
+    EntriesHold building(&list);
 
     if (mechanism == nullptr || mechanism[0] == '\0') return leave(bad_param(kInternal, kName, tp::kReadMapfilesBadArg, 1, addr(mechanism)));
     if (set == nullptr) return leave(bad_param(kInternal, kName, tp::kReadMapfilesBadArg, 2, 0));
@@ -947,7 +897,6 @@ int32_t idm__native_read_mapfiles(const char *mechanism, idm_mapfile_set **set, 
     idm_mapfile_set *files = *set;
     if (int32_t r = idm__native_test_mapfiles(files); r != 0) return leave(r);
 
-    idm_entry_list &list = building.list();
     for (int32_t i = 0; i < files->count; ++i) {
         if ((files->flags[i] & MF_IN_USE) == 0) continue;
         FileOutcome outcome;
@@ -971,7 +920,7 @@ int32_t idm__native_read_mapfiles(const char *mechanism, idm_mapfile_set **set, 
     idm__native_release_entry_list(*count, *entries);
     *count = list.count;
     *entries = list.entries;
-    building.disarm();
+    building.release();
     return leave(0);
 }
 

@@ -270,22 +270,18 @@ int enumeration_error(int result) { return result > 0 ? result : errno; }
 
 // Holds the group-scan mutex for one enumeration; the destructor (normal
 // exit or cancellation) calls endgrent and unlocks.
-class GroupScanHold {
+class GroupScanHold : Pinned {
   public:
     GroupScanHold() { pthread_mutex_lock(&idm__native_group_scan_mutex); }
     ~GroupScanHold() { idm::forget_dead_frames(); idm__thread_cleanup_group_scan(&idm__native_group_scan_mutex); }
-    GroupScanHold(const GroupScanHold &) = delete;
-    GroupScanHold &operator=(const GroupScanHold &) = delete;
 };
 
 // A lookup work buffer.  It holds database entries (user names, home
 // directories), so it is zeroed before it is freed, also on cancellation.
-struct WorkBuffer {
+struct WorkBuffer : Pinned {
     char *p = nullptr;
     size_t n = 0;
     WorkBuffer() = default;
-    WorkBuffer(const WorkBuffer &) = delete;
-    WorkBuffer &operator=(const WorkBuffer &) = delete;
     ~WorkBuffer() { release(); }
     // 0, or 6 (2650-654 with the size).
     int32_t allocate(size_t size) {
@@ -303,12 +299,10 @@ struct WorkBuffer {
 
 // The result array under construction.  Unless handed over, the destructor
 // frees every element's value and then the array.
-struct GroupList {
+struct GroupList : Pinned {
     idm_buffer *items = nullptr;
     uint32_t count = 0;
     GroupList() = default;
-    GroupList(const GroupList &) = delete;
-    GroupList &operator=(const GroupList &) = delete;
     ~GroupList() {
         for (uint32_t i = 0; i < count; ++i) std::free(items[i].value);
         std::free(items);

@@ -13,30 +13,10 @@
 
 namespace {
 
-// A waiting reader: ending the scope runs sec__waiting_reader_cleanup.
-class WaitingReader {
-  public:
-    explicit WaitingReader(sec_rwlock *lock) : lock_(lock) {}
-    ~WaitingReader() { idm::forget_dead_frames(); sec__waiting_reader_cleanup(lock_); }
-    WaitingReader(const WaitingReader &) = delete;
-    WaitingReader &operator=(const WaitingReader &) = delete;
-
-  private:
-    sec_rwlock *lock_;
-};
-
-// A waiting writer, already counted in waiting_writers: ending the scope runs
-// sec__waiting_writer_cleanup.
-class WaitingWriter {
-  public:
-    explicit WaitingWriter(sec_rwlock *lock) : lock_(lock) {}
-    ~WaitingWriter() { idm::forget_dead_frames(); sec__waiting_writer_cleanup(lock_); }
-    WaitingWriter(const WaitingWriter &) = delete;
-    WaitingWriter &operator=(const WaitingWriter &) = delete;
-
-  private:
-    sec_rwlock *lock_;
-};
+// A waiting reader, and a waiting writer already counted in
+// waiting_writers: ending the scope runs the matching clean-up.
+using WaitingReader = idm::Hold<sec_rwlock, sec__waiting_reader_cleanup>;
+using WaitingWriter = idm::Hold<sec_rwlock, sec__waiting_writer_cleanup>;
 
 // Mutex held.  Readers go when no writer holds the lock and none waits.
 void wait_as_reader(sec_rwlock *lock) {
