@@ -7,9 +7,12 @@
 
 #define OXSECLIB_MSG_COUNT 624
 
+#ifdef __cplusplus
 extern "C" {
+#endif
 extern const char *const cu_mesgtbl_oxseclib_msg[OXSECLIB_MSG_COUNT];
 extern const char cu_badid_oxseclib_msg[];
+#ifdef __cplusplus
 }
 
 namespace idm {
@@ -43,5 +46,6 @@ enum Msg : int {
 };
 
 }  // namespace idm
+#endif
 
 #endif
