@@ -1,6 +1,7 @@
 #!/bin/bash
-# Builds and runs every test: the whole suite as a plain debug build and under
-# ASan+UBSan, and the concurrency tests under TSan.  Installs missing Debian
+# Builds and runs every test: the library's lock annotations checked by
+# clang, the whole suite as a plain debug build and under ASan+UBSan, and the
+# concurrency tests under TSan.  Installs missing Debian
 # packages first.  Warnings are errors here.
 set -euo pipefail
 cd "$(dirname "$0")/.."
@@ -16,6 +17,9 @@ run_suite() {  # preset, ctest arguments...
   echo "=== $preset: test" >&2
   ctest --preset "$preset" -j "$jobs" --timeout 300 "$@" || status=1
 }
+echo "=== thread-safety: the library under clang's lock analysis" >&2
+cmake --preset thread-safety $werror >/dev/null
+cmake --build --preset thread-safety -j "$jobs" || status=1
 run_suite debug
 run_suite asan-ubsan
 run_suite tsan

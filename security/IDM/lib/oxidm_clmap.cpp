@@ -106,7 +106,7 @@ void trace_alloc_failure(int32_t site, size_t bytes) {
 }
 
 // Empties both trees; the caller holds the write hold.
-void clean_trees() {
+void clean_trees() OXIDM_REQUIRES(idmutex) {
     if (nametree.rst_node_cnt != 0) sec__rst_clean(&nametree);
     if (iptree.rst_node_cnt != 0) sec__rst_clean(&iptree);
 }
@@ -125,8 +125,7 @@ class OldTrees : Pinned {
     OldTrees() = default;
     ~OldTrees() { release(); }
 
-    // Caller holds the write hold.
-    void take() {
+    void take() OXIDM_REQUIRES(idmutex) {
         move(nametree, names_);
         move(iptree, addresses_);
     }
@@ -544,7 +543,7 @@ class Builder : Pinned {
 };
 
 // Empties both trees under the write hold (file missing or empty).
-void empty_trees(MapHold &hold) {
+void empty_trees(MapHold &hold) OXIDM_REQUIRES_SHARED(idmutex) {
     OldTrees old;
     hold.promote();
     {
@@ -620,7 +619,7 @@ bool cut_line(const Text &text, const FileStamp &stamp) {
 }
 
 // The reload rule; see read_clmap_file and the module header.
-int32_t load(MapHold &hold) {
+int32_t load(MapHold &hold) OXIDM_REQUIRES_SHARED(idmutex) {
     struct stat st;
     for (;;) {
         if (::stat(kNodeInfoPath, &st) != 0) {
@@ -679,24 +678,24 @@ int32_t load(MapHold &hold) {
 
 }  // namespace
 
-MapHold::MapHold(sec_rwlock *lock) : lock_(lock) {
+MapHold::MapHold(sec_rwlock *lock) OXIDM_NO_THREAD_SAFETY_ANALYSIS : lock_(lock) {
     sec__lock_read(lock_);
     mode_ = kRead;
 }
 
-MapHold::~MapHold() {
+MapHold::~MapHold() OXIDM_NO_THREAD_SAFETY_ANALYSIS {
     idm::forget_dead_frames();
     if (mode_ == kRead) sec__unlock_read(lock_);
     else if (mode_ == kWrite) sec__unlock_write(lock_);
 }
 
-void MapHold::promote() {
+void MapHold::promote() OXIDM_NO_THREAD_SAFETY_ANALYSIS {
     mode_ = kNone;  // the read share is given up before the wait
     sec__lock_promote(lock_);
     mode_ = kWrite;
 }
 
-void MapHold::wait_for_load(int64_t t) {
+void MapHold::wait_for_load(int64_t t) OXIDM_NO_THREAD_SAFETY_ANALYSIS {
     mode_ = kNone;
     sec__unlock_read(lock_);
     {
@@ -709,7 +708,7 @@ void MapHold::wait_for_load(int64_t t) {
     mode_ = kRead;
 }
 
-void MapHold::demote() {
+void MapHold::demote() OXIDM_NO_THREAD_SAFETY_ANALYSIS {
     mode_ = kNone;  // the write hold is given up before the wait
     sec__lock_demote(lock_);
     mode_ = kRead;

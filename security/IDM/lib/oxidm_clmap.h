@@ -57,6 +57,10 @@ struct idm_clnode {
     int32_t count;
 };
 
+// The cluster trees' lock: a read share for every query, the write hold
+// while a load rebuilds the trees.
+extern "C" sec_rwlock idmutex;
+
 namespace idm::clmap {
 
 inline constexpr char kNodeInfoPath[] = "/var/ox/cfg/oxsec.nodeinfo";
@@ -67,12 +71,14 @@ inline constexpr int32_t kNotFound = 1;  // host not listed: no failure, nothing
 // waits, since both give up the previous hold first.  The destructor
 // releases whatever is held at that moment, so a query cancelled anywhere
 // (in a lock wait, in open or read) leaves idmutex consistent.
-class MapHold : idm::Pinned {
+class OXIDM_SCOPED_CAPABILITY MapHold : idm::Pinned {
   public:
-    explicit MapHold(sec_rwlock *lock);
-    ~MapHold();
-    void promote();
-    void demote();
+    explicit MapHold(sec_rwlock *lock) OXIDM_ACQUIRE_SHARED(*lock);
+    ~MapHold() OXIDM_RELEASE_GENERIC();
+    // The hold is always of idmutex; the two changes of mode are told to the
+    // analysis in its name.
+    void promote() OXIDM_RELEASE_SHARED(idmutex) OXIDM_ACQUIRE(idmutex);
+    void demote() OXIDM_RELEASE(idmutex) OXIDM_ACQUIRE_SHARED(idmutex);
     // Gives up the read share until the load that claimed time `t` has
     // ended (or another claim replaced it), then takes a share again.
     void wait_for_load(int64_t t);
@@ -152,20 +158,22 @@ void announce_load_outcome();
 // the read share is held).  1: not found (also a null or empty host, a
 // missing or empty file, an empty tree; nothing reported).  6 memory, 21
 // file access or syntax, 23 tree insertion (each reported where detected).
-int32_t sec__get_cluster_names(idm::clmap::MapHold &hold, const char *host, char ***clusters, int32_t *count);
+int32_t sec__get_cluster_names(idm::clmap::MapHold &hold, const char *host, char ***clusters, int32_t *count)
+    OXIDM_REQUIRES_SHARED(idmutex);
 // The reload rule.  0: the trees are as current as this load could make
 // them; 6, 21, 23 as above.
-int32_t idm__read_clmap_file(idm::clmap::MapHold &hold);
+int32_t idm__read_clmap_file(idm::clmap::MapHold &hold)
+    OXIDM_REQUIRES_SHARED(idmutex);
 // Parses `text` (`size` bytes, ending with an LF) and rebuilds both trees
 // under the write hold.  Any failure leaves both trees empty.
-int32_t idm__construct_clcfg(idm::clmap::MapHold &hold, const char *text, size_t size);
+int32_t idm__construct_clcfg(idm::clmap::MapHold &hold, const char *text, size_t size)
+    OXIDM_REQUIRES_SHARED(idmutex);
 
 extern "C" {
 
-extern rst_tree nametree;  // keyed by host name
-extern rst_tree iptree;    // keyed by address text
-extern int64_t lastmod;    // atomically accessed
-extern sec_rwlock idmutex;
+extern rst_tree nametree OXIDM_GUARDED_BY(idmutex);  // keyed by host name
+extern rst_tree iptree OXIDM_GUARDED_BY(idmutex);    // keyed by address text
+extern int64_t lastmod;                              // atomically accessed
 
 // Extracts one value as scan_value() cuts it.  0: *attr_value is the
 // value's heap copy (free), or null when there was none; *consumed is the

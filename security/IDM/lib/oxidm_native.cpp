@@ -66,8 +66,13 @@ int32_t idm__native_register_translator(const char *mnemonic, idm_translator_rou
                 if (created->mnemonic == nullptr) {
                     status = report_no_memory(kName, std::strlen(mnemonic) + 1);
                 } else {
-                    created->translator = translator;
-                    created->cleanup = cleanup;
+                    {
+                        // Not yet published; locked so that the fields are
+                        // only ever written under their mutex.
+                        MutexHold record(&created->mutex);
+                        created->translator = translator;
+                        created->cleanup = cleanup;
+                    }
                     created->next = idm__native_state.translators;
                     idm__native_state.translators = created;
                     __atomic_store_n(&idm__native_state.translator_count,

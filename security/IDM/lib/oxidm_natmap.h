@@ -14,8 +14,7 @@
 #include <cstdint>
 
 #include "oxidm.h"
-
-struct idm_translator;
+#include "oxidm_state.h"
 
 extern "C" {
 
@@ -64,7 +63,7 @@ int32_t idm__native_get_mapping(idm_rule *rule, idm_id *id, idm_buffer *result);
 // slots, new slots zeroed) and sets the entry's 1-based `rule_index`.  The
 // cache owns the rule's contents from then on.  Returns 0, or 6 with 2650-654
 // (cache unchanged).  Caller holds the translator's mutex.
-int32_t idm__native_cache_rule(idm_translator *translator, idm_mapfile_entry *entry, idm_rule *rule);
+int32_t idm__native_cache_rule(idm_translator *translator, idm_mapfile_entry *entry, idm_rule *rule) OXIDM_REQUIRES(translator->mutex);
 
 // Calls `cleanup` (rule slot, null) for each of the `count` cached rules in
 // order, then frees the array.  Nothing for count < 1 or a null list.

@@ -191,7 +191,7 @@ struct TracePoint {
 
 inline constexpr TracePoint kTracePoints[] = {
 #define OXIDM_TP_ROW(name, id, category, levels, routine, what, items) \
-    {tp::name, #name + 1, category, static_cast<uint8_t>(levels), routine, what, items},
+    {tp::name, &#name[1], category, static_cast<uint8_t>(levels), routine, what, items},
     OXIDM_TRACE_POINTS(OXIDM_TP_ROW)
 #undef OXIDM_TP_ROW
 };

@@ -62,17 +62,17 @@ int sec__lock_destroy(sec_rwlock *lock) {
 
 int sec__simple_init(pthread_mutex_t *mutex) { return idm::mutex_init(mutex); }
 
-void sec__lock_read(sec_rwlock *lock) {
+void sec__lock_read(sec_rwlock *lock) OXIDM_NO_THREAD_SAFETY_ANALYSIS {
     pthread_mutex_lock(&lock->mutex);
     wait_as_reader(lock);
 }
 
-void sec__unlock_read(sec_rwlock *lock) {
+void sec__unlock_read(sec_rwlock *lock) OXIDM_NO_THREAD_SAFETY_ANALYSIS {
     idm::MutexHold hold(&lock->mutex);
     if (--lock->lock_count == 0) pthread_cond_signal(&lock->writer_ok);
 }
 
-void sec__lock_write(sec_rwlock *lock) {
+void sec__lock_write(sec_rwlock *lock) OXIDM_NO_THREAD_SAFETY_ANALYSIS {
     pthread_mutex_lock(&lock->mutex);
     wait_as_writer(lock);
 }
@@ -84,19 +84,19 @@ int sec__trylock_write(sec_rwlock *lock) {
     return 0;
 }
 
-void sec__unlock_write(sec_rwlock *lock) {
+void sec__unlock_write(sec_rwlock *lock) OXIDM_NO_THREAD_SAFETY_ANALYSIS {
     idm::MutexHold hold(&lock->mutex);
     lock->lock_count = 0;
     wake_after_writer(lock);
 }
 
-void sec__lock_promote(sec_rwlock *lock) {
+void sec__lock_promote(sec_rwlock *lock) OXIDM_NO_THREAD_SAFETY_ANALYSIS {
     pthread_mutex_lock(&lock->mutex);
     if (lock->lock_count > 0 && --lock->lock_count == 0) pthread_cond_signal(&lock->writer_ok);
     wait_as_writer(lock);
 }
 
-void sec__lock_demote(sec_rwlock *lock) {
+void sec__lock_demote(sec_rwlock *lock) OXIDM_NO_THREAD_SAFETY_ANALYSIS {
     pthread_mutex_lock(&lock->mutex);
     lock->lock_count = 0;
     wake_after_writer(lock);

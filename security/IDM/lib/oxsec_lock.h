@@ -27,7 +27,9 @@
 
 #include <cstdint>
 
-struct sec_rwlock {
+#include "oxidm_annotations.h"
+
+struct OXIDM_CAPABILITY("rwlock") sec_rwlock {
     pthread_mutex_t mutex;     // guards lock_count and waiting_writers
     pthread_cond_t readers_ok; // would-be readers wait here
     pthread_cond_t writer_ok;  // would-be writers and promoting readers wait here
@@ -46,17 +48,17 @@ int sec__lock_destroy(sec_rwlock *lock);
 // pthread_mutex_init of a plain mutex with default attributes; its result.
 int sec__simple_init(pthread_mutex_t *mutex);
 
-void sec__lock_read(sec_rwlock *lock);
-void sec__unlock_read(sec_rwlock *lock);
-void sec__lock_write(sec_rwlock *lock);
+void sec__lock_read(sec_rwlock *lock) OXIDM_ACQUIRE_SHARED(*lock);
+void sec__unlock_read(sec_rwlock *lock) OXIDM_RELEASE_SHARED(*lock);
+void sec__lock_write(sec_rwlock *lock) OXIDM_ACQUIRE(*lock);
 // 0: the write hold was free and is now the caller's; -1: the lock was held.
 // Never waits for the lock; waiting writers are not considered.
 int sec__trylock_write(sec_rwlock *lock);
-void sec__unlock_write(sec_rwlock *lock);
+void sec__unlock_write(sec_rwlock *lock) OXIDM_RELEASE(*lock);
 // Read hold -> write hold (gives up the read share first).
-void sec__lock_promote(sec_rwlock *lock);
+void sec__lock_promote(sec_rwlock *lock) OXIDM_RELEASE_SHARED(*lock) OXIDM_ACQUIRE(*lock);
 // Write hold -> read hold (waiting writers go first).
-void sec__lock_demote(sec_rwlock *lock);
+void sec__lock_demote(sec_rwlock *lock) OXIDM_RELEASE(*lock) OXIDM_ACQUIRE_SHARED(*lock);
 
 // Clean-ups of a waiting scope; both run with `mutex` held and release it.
 void sec__waiting_reader_cleanup(sec_rwlock *lock);
