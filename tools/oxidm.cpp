@@ -19,6 +19,7 @@
 #include "oxidm_json.h"
 #include "oxidm_rootns.h"
 #include "oxidm_tracefmt.h"
+#include "oxidm_tracepoints.h"
 
 namespace oxidm_tool {
 
@@ -185,7 +186,7 @@ int cmd_groups(Context &ctx, const Args &in) {
 // ---- cluster ----
 
 // Trace point of the node file's load step, with the load's status.
-constexpr int kLoadEndPoint = 173;
+constexpr int kLoadEndPoint = idm::trace::tp::kNodeFileEnd;
 
 // True when a load step recorded since record `from` ended with a failure.
 bool load_failed_since(size_t from) {
@@ -219,8 +220,8 @@ int cmd_cluster(Context &ctx, const Args &in) {
         active_known = cu_get_cluster_info_1(&info) == 0;
         if (active_known) active_name.assign(info.cluster_name, strnlen(info.cluster_name, sizeof info.cluster_name));
     }
-    // The load step's trace points (154, 173) are written at any API level
-    // but 0; level 2 writes no others.
+    // The load step's trace points (kNodeFileStart, kNodeFileEnd) are written
+    // at any API level but 0; level 2 writes no others.
     if ((ctx.tracing ? ctx.trace_levels.level[1] : 0) == 0) trx_set_level("_SEI", 1, 2);
     int worst = kExitAnswer;
     Json json;

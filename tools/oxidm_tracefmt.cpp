@@ -1,166 +1,43 @@
-// Trace id table and record decoding.  The table lists every id the library
-// records, with the routine that records it; 8-byte items are addresses
-// unless their name starts with '#' (then a count or a time).
+// Trace records decoded by the library's own table of trace points
+// (oxidm_tracepoints.h): routine, meaning and item names of every id; 8-byte
+// items are addresses unless their name starts with '#' (then a count or a
+// time).
 #include "oxidm_tracefmt.h"
 
 #include <algorithm>
 #include <cctype>
 #include <cstring>
+#include <deque>
 #include <string_view>
 
 #include "ox_tr.h"
+#include "oxidm_tracepoints.h"
 #include "oxidm_json.h"
 
 namespace oxidm_tool {
 
 namespace {
 
-constexpr TraceIdInfo kIds[] = {
-    {2, "idm__trace_routine_end", "end of routine", {"routine"}},
-    {3, "idm__trace_routine_end", "end of routine", {"routine", "status"}},
-    {4, "idm__native_read_mapfiles", "entry", {}},
-    {5, "idm__native_read_mapfiles", "exit", {}},
-    {6, "idm__native_read_mapfiles", "bad argument", {"position", "value"}},
-    {8, "idm__native_read_mapfiles", "arguments",
-     {"mechanism", "set location", "set", "count location", "count", "array location", "array"}},
-    {9, "idm__native_read_mapfiles", "Diag: file about to be parsed", {"path"}},
-    {12, "idm__native_read_mapfiles", "exit data",
-     {"status", "set location", "set", "count location", "count", "array location"}},
-    {13, "idm__native_get_mapfile_names", "entry", {}},
-    {15, "idm__native_get_mapfile_names", "entry data", {"set_out", "*set_out"}},
-    {16, "idm__native_get_mapfile_names", "exit", {}},
-    {17, "idm__native_get_mapfile_names", "exit data: file of the set", {"index", "path"}},
-    {21, "idm__native_get_mapfile_names", "bad argument", {"position", "value"}},
-    {22, "idm__native_get_mapfile_names", "allocation failure", {"site", "bytes"}},
-    {24, "idm__ready_mapfile", "entry", {}},
-    {26, "idm__ready_mapfile", "entry data", {"path", "descriptor location", "stream location"}},
-    {27, "idm__ready_mapfile", "exit", {}},
-    {29, "idm__ready_mapfile", "exit data", {"status", "path", "descriptor", "stream"}},
-    {30, "idm__ready_mapfile", "Diag: sec__open_file", {"path", "result", "descriptor"}},
-    {31, "idm__ready_mapfile", "Diag: sec__readlock_file", {"path", "result"}},
-    {32, "idm__ready_mapfile", "Diag: stream opened", {}},
-    {34, "idm__ready_mapfile", "Diag: stream not opened", {"path", "errno", "stream"}},
-    {35, "idm__ready_mapfile", "bad argument", {"position"}},
-    {36, "idm__parse_mapfile", "entry", {}},
-    {38, "idm__parse_mapfile", "entry data", {"stream", "count location", "count", "array location"}},
-    {39, "idm__parse_mapfile", "exit", {}},
-    {40, "idm__parse_mapfile", "exit data", {"status", "count", "array location"}},
-    {42, "idm__parse_mapfile", "Diag: reading file", {"path", "mechanism"}},
-    {43, "idm__parse_mapfile", "Diag: line as read", {"line"}},
-    {44, "idm__parse_mapfile", "Diag: empty line", {}},
-    {45, "idm__parse_mapfile", "Diag: line skipped (blank, comment or other mechanism)", {}},
-    {46, "idm__parse_mapfile", "Diag: reading ended", {}},
-    {47, "idm__parse_mapfile", "bad argument", {"position", "value"}},
-    {48, "idm__read_mapfile_entries", "entry", {}},
-    {50, "idm__read_mapfile_entries", "entry data", {"line", "count", "array location"}},
-    {51, "idm__read_mapfile_entries", "exit", {}},
-    {53, "idm__read_mapfile_entries", "exit data", {"status", "array location"}},
-    {55, "idm__alloc_entries", "Diag: entry array grows", {"count", "bytes"}},
-    {56, "idm__read_mapfile_entries", "Diag: invalid line ignored", {}},
-    {58, "idm__read_mapfile_entries", "Diag: new entry", {"#read_time", "kind", "network_id", "local_id"}},
-    {59, "idm__read_mapfile_entries", "bad argument", {"position", "value"}},
-    {61, "idm__alloc_entries", "allocation failure", {"bytes"}},
-    {62, "idm__read_mapfile_entries", "allocation failure: network identifier", {"bytes"}},
-    {65, "idm__read_mapfile_entries", "allocation failure: local identifier", {"bytes"}},
-    {67, "idm__native_test_mapfiles_v1", "entry", {}},
-    {68, "idm__native_test_mapfiles_v1", "Diag: file appeared", {"path"}},
-    {69, "idm__native_test_mapfiles_v1", "Diag: appeared file selected", {"path"}},
-    {70, "idm__native_test_mapfiles_v1", "Diag: parsed in the second of its change, read again", {"path"}},
-    {71, "idm__native_test_mapfiles_v1", "Diag: superseded", {"path", "superseded by"}},
-    {72, "idm__native_test_mapfiles_v1", "Diag: still present", {"path"}},
-    {73, "idm__native_test_mapfiles_v1", "Diag: selected", {"path"}},
-    {74, "idm__native_test_mapfiles_v1", "Diag: modification time changed", {"path"}},
-    {75, "idm__native_test_mapfiles_v1", "Diag: unchanged (or still absent)", {"path"}},
-    {76, "idm__native_test_mapfiles_v1", "Diag: removed", {"path"}},
-    {77, "idm__native_test_mapfiles_v1", "Diag: superseding file removed, read again", {"path"}},
-    {78, "idm__native_test_mapfiles_v1", "exit", {}},
-    {79, "idm__native_test_mapfiles_v1", "exit data", {"result"}},
-    {80, "idm__native_test_mapfiles", "entry", {}},
-    {81, "idm__native_test_mapfiles", "bad argument", {"position", "value"}},
-    {82, "idm__native_test_mapfiles", "layout version not 1", {"version"}},
-    {83, "idm__native_test_mapfiles", "Diag: file state",
-     {"index", "path", "present", "in use", "removed", "reread", "mtime", "read_time"}},
-    {84, "idm__native_test_mapfiles", "exit", {}},
-    {85, "idm__native_test_mapfiles", "exit data", {"result"}},
-    {87, "idm__thread_cleanup_mapfile", "Diag: open file released", {"path", "descriptor", "stream"}},
-    {88, "sec_idm_register_translator", "entry", {}},
-    {90, "sec_idm_register_translator", "entry data", {"mapping type", "mnemonic", "translator", "cleanup"}},
-    {91, "sec_idm_register_translator", "exit", {}},
-    {92, "sec_idm_register_translator", "exit data", {"status", "state word 0", "translator count"}},
-    {93, "sec_idm_map_identity", "entry", {}},
-    {95, "sec_idm_map_identity", "entry data", {"mnemonic", "network identity", "result buffer"}},
-    {96, "sec_idm_map_identity", "exit", {}},
-    {97, "sec_idm_map_identity", "exit data", {"status", "state word 0"}},
-    {98, "sec_idm_get_groups", "entry", {}},
-    {100, "sec_idm_get_groups", "entry data", {"user buffer", "count location", "list location"}},
-    {101, "sec_idm_get_groups", "exit", {}},
-    {102, "sec_idm_get_groups", "exit data", {"status"}},
-    {103, "idm__native_register_translator", "entry", {}},
-    {105, "idm__native_register_translator", "entry data", {"mnemonic", "translator", "cleanup"}},
-    {106, "idm__native_register_translator", "exit", {}},
-    {107, "idm__native_register_translator", "exit data", {"status"}},
-    {108, "idm__native_map_identity", "entry", {}},
-    {110, "idm__native_map_identity", "entry data", {"mnemonic", "network identity", "result buffer"}},
-    {111, "idm__native_map_identity", "exit", {}},
-    {112, "idm__native_map_identity", "exit data", {"status"}},
-    {113, "idm__native_get_groups", "entry", {}},
-    {115, "idm__native_get_groups", "entry data", {"user buffer", "count location", "list location"}},
-    {116, "idm__native_get_groups", "exit", {}},
-    {117, "idm__native_get_groups", "exit data", {"status"}},
-    {118, "idm__native_check_rule", "entry", {}},
-    {120, "idm__native_check_rule", "entry data", {"rule"}},
-    {121, "idm__native_check_rule", "exit", {}},
-    {122, "idm__native_check_rule", "exit data", {"status"}},
-    {123, "idm__native_check_id", "entry", {}},
-    {125, "idm__native_check_id", "entry data", {"id"}},
-    {126, "idm__native_check_id", "exit", {}},
-    {127, "idm__native_check_id", "exit data", {"status"}},
-    {128, "idm__native_apply_rule", "entry", {}},
-    {130, "idm__native_apply_rule", "entry data", {"rule", "id", "result"}},
-    {131, "idm__native_apply_rule", "Mapping: rule and id matched",
-     {"rule rgy_type", "rule rgy", "rule token_cnt", "rule tokens", "id rgy_type", "id rgy", "id token_cnt",
-      "id tokens"}},
-    {133, "idm__native_apply_rule", "Mapping: result", {"local identity"}},
-    {134, "idm__native_apply_rule", "exit", {}},
-    {135, "idm__native_apply_rule", "exit data", {"status"}},
-    {136, "idm__trace_native_rule", "rule", {"rule_state", "rgy_type", "rgy", "token_cnt"}},
-    {137, "idm__trace_native_id", "id", {"rgy_type", "rgy", "token_cnt"}},
-    {138, "idm__trace_native_rule", "rule mapping", {"length", "value"}},
-    {139, "idm__trace_native_rule/id", "token", {"position", "token"}},
-    {140, "sec_is_in_active_cluster", "entry", {}},
-    {141, "sec_is_in_active_cluster", "entry data", {"host"}},
-    {142, "sec_is_in_active_cluster", "exit", {}},
-    {143, "sec_is_in_active_cluster", "exit data", {"answer"}},
-    {144, "sec_is_in_any_cluster", "entry", {}},
-    {145, "sec_is_in_any_cluster", "entry data", {"host"}},
-    {146, "sec_is_in_any_cluster", "exit", {}},
-    {147, "sec_is_in_any_cluster", "exit data", {"answer"}},
-    {148, "sec__idm_clmap_init", "entry", {}},
-    {149, "sec__idm_clmap_init", "exit", {}},
-    {150, "sec__get_cluster_names", "entry", {}},
-    {151, "sec__get_cluster_names", "entry data", {"host"}},
-    {152, "sec__get_cluster_names", "exit", {}},
-    {153, "sec__get_cluster_names", "exit data", {"result"}},
-    {154, "idm__read_clmap_file", "start", {}},
-    {155, "idm__construct_clcfg", "Diag: parsing", {"text", "#length"}},
-    {157, "idm__construct_clcfg", "error: host record incomplete", {}},
-    {158, "idm__construct_clcfg", "Diag: host record complete", {}},
-    {159, "idm__construct_clcfg", "Diag: name", {"index", "value"}},
-    {160, "idm__construct_clcfg", "Diag: address", {"index", "value"}},
-    {161, "idm__construct_clcfg", "Diag: cluster", {"index", "value"}},
-    {162, "idm__construct_clcfg", "Diag: tree record not made", {"attribute", "value"}},
-    {163, "idm__construct_clcfg", "allocation failure", {"site", "#bytes"}},
-    {164, "idm__construct_clcfg", "error: NODE without \":\"", {}},
-    {165, "idm__construct_clcfg", "error: NAME outside a host record, or repeated", {}},
-    {166, "idm__construct_clcfg", "error: NAME without \":\"", {}},
-    {167, "idm__construct_clcfg", "error: ADDRESS outside a host record, or repeated", {}},
-    {168, "idm__construct_clcfg", "error: ADDRESS without \":\"", {}},
-    {169, "idm__construct_clcfg", "error: CLUSTER outside a host record, or repeated", {}},
-    {170, "idm__construct_clcfg", "error: CLUSTER without \":\"", {}},
-    {171, "idm__construct_clcfg", "error: statement without a keyword", {}},
-    {172, "idm__construct_clcfg", "error: tree insertion failed", {"attribute"}},
-    {173, "idm__read_clmap_file", "end", {"status"}},
-};
+// The library's table of trace points, each row's item names split out
+// (the table keeps them as one ", "-separated text).
+const std::vector<TraceIdInfo> &table() {
+    static const std::vector<TraceIdInfo> rows = [] {
+        static std::deque<std::string> names;  // the split names, kept for the process
+        std::vector<TraceIdInfo> v;
+        for (const idm::trace::TracePoint &p : idm::trace::kTracePoints) {
+            TraceIdInfo t{p.id, p.routine, p.what, {}};
+            std::string_view items = p.items;
+            for (size_t j = 0; !items.empty() && j < 8; ++j) {
+                const size_t comma = items.find(", ");
+                t.items[j] = names.emplace_back(items.substr(0, comma)).c_str();
+                items = comma == std::string_view::npos ? std::string_view{} : items.substr(comma + 2);
+            }
+            v.push_back(t);
+        }
+        return v;
+    }();
+    return rows;
+}
 
 bool is_address_name(const char *name) {
     if (name == nullptr) return true;
@@ -198,7 +75,7 @@ const char *item_name(const TraceIdInfo *info, size_t j) {
 }  // namespace
 
 const TraceIdInfo *trace_id_info(int id) {
-    for (const TraceIdInfo &t : kIds)
+    for (const TraceIdInfo &t : table())
         if (t.id == id) return &t;
     return nullptr;
 }

@@ -19,10 +19,13 @@
 #include "oxidm.h"
 #include "oxidm_cli.h"
 #include "oxidm_json.h"
+#include "oxidm_tracepoints.h"
 #include "oxidm_plugins.h"
 #include "oxidm_tracefmt.h"
 
 namespace oxidm_tool {
+
+namespace tp = idm::trace::tp;
 
 namespace {
 
@@ -178,7 +181,7 @@ ParseView read_parse_records(const std::vector<TraceRecord> &records) {
     std::string file;
     for (const TraceRecord &r : records) {
         switch (r.id) {
-            case 83:
+            case tp::kTestFilesState:
                 if (r.items.size() >= 4) {
                     int index = r.i32(0);
                     std::string path = r.text(1);
@@ -192,11 +195,11 @@ ParseView read_parse_records(const std::vector<TraceRecord> &records) {
                     if (!known) v.files.push_back({index, path, present, in_use});
                 }
                 break;
-            case 42:
+            case tp::kParseFile:
                 file = r.text(0);
                 next_line = 1;
                 break;
-            case 43: {
+            case tp::kParseLine: {
                 std::string t = r.text(0);
                 bool ends_line = (!t.empty() && t.back() == '\n') || t.size() < 1023;
                 if (!t.empty() && t.back() == '\n') t.pop_back();
@@ -204,14 +207,14 @@ ParseView read_parse_records(const std::vector<TraceRecord> &records) {
                 if (ends_line) ++next_line;
                 break;
             }
-            case 56: {
+            case tp::kEntriesInvalidLine: {
                 ParsedLine l;
                 l.where = current;
                 l.invalid = true;
                 v.lines.push_back(l);
                 break;
             }
-            case 58: {
+            case tp::kEntriesNewEntry: {
                 ParsedLine l;
                 l.where = current;
                 l.entry = static_cast<int>(v.entry_line.size());
@@ -265,43 +268,43 @@ Verdict read_walk_records(const std::vector<TraceRecord> &records) {
     };
     for (const TraceRecord &r : records) {
         switch (r.id) {
-            case 136:
+            case tp::kDumpRule:
                 finish_dump();
                 dumping = kRule;
                 rgy_type = r.text(1);
                 rgy = r.text(2);
                 break;
-            case 137:
+            case tp::kDumpId:
                 finish_dump();
                 dumping = kId;
                 rgy_type = r.text(0);
                 rgy = r.text(1);
                 break;
-            case 139:
+            case tp::kDumpToken:
                 if (dumping != kNone) tokens.push_back(r.text(1));
                 break;
-            case 138:
+            case tp::kDumpRuleMapping:
                 has_mapping = true;
                 mapping = r.text(1);
                 break;
-            case 122:
+            case tp::kCheckRuleExitData:
                 finish_dump();
                 v.check_rule = r.i32(0);
                 break;
-            case 127:
+            case tp::kCheckIdExitData:
                 finish_dump();
                 v.check_id = r.i32(0);
                 break;
-            case 131:
+            case tp::kApplyMatched:
                 v.matched = true;
                 break;
-            case 133: {
+            case tp::kApplyResult: {
                 v.matched = true;
                 std::string value = r.text(0);
                 v.result = value == "[null]" ? "" : value;
                 break;
             }
-            case 135:
+            case tp::kApplyExitData:
                 finish_dump();
                 v.apply = r.i32(0);
                 if (v.apply == 0) v.matched = true;
@@ -332,10 +335,10 @@ std::string describe(const Verdict &v, bool denial) {
         return v.message.text.empty() ? what : what + ": " + short_message(v.message.text);
     };
     switch (v.translator_status) {
-        case 0: break;
-        case 31: return with_message("the translator stopped the walk (status 31)");
-        case 38: return with_message("the translator rejected the identity or the line (status 38)");
-        case 39:
+        case IDM_OK: break;
+        case IDM_TRANSLATOR_STOP: return with_message("the translator stopped the walk (status 31)");
+        case IDM_TRANSLATOR_REJECT: return with_message("the translator rejected the identity or the line (status 38)");
+        case IDM_TRANSLATOR_REFUSED:
             return with_message("the translator refused the line (status 39): not tried again until the map "
                                 "files change");
         default:
@@ -412,7 +415,7 @@ Outcome map_one(const std::string &mnemonic, const std::string &identity) {
                       " (the library reported no message)";
     }
     for (const TraceRecord &r : captured_records(o.first_record))
-        if (r.id == 131 || r.id == 133) o.matched = true;
+        if (r.id == tp::kApplyMatched || r.id == tp::kApplyResult) o.matched = true;
     return o;
 }
 
