@@ -1,0 +1,176 @@
+// The table of trace points walked once: a session of mapping, group and
+// cluster calls (good and bad) runs under each setting of the five levels,
+// and every record it leaves must be a row of the table, recorded at a level
+// the row names, with the row's record kind and item count.  With all levels
+// 0 nothing is recorded at all, and across the settings every row that such a
+// session can reach is reached.
+#include <algorithm>
+#include <cstdio>
+#include <set>
+#include <string>
+#include <string_view>
+
+#include "harness.h"
+#include "oxidm_clmap.h"
+#include "oxidm_natfile.h"
+#include "oxidm_natmap.h"
+#include "oxidm_state.h"
+#include "oxidm_tracepoints.h"
+#include "test_mpm.h"
+
+namespace {
+
+using idm::trace::kTracePoints;
+using idm::trace::TracePoint;
+namespace tp = idm::trace::tp;
+
+// The entry's network identifier is the rule's only token, its local
+// identifier the mapping; an identity "stop" ends the walk.
+int32_t translate(const idm_mapfile_entry *entry, const char *network_id, idm_rule *rule, idm_id *id) {
+    if (std::string_view(network_id) == "stop") return IDM_TRANSLATOR_STOP;
+    if (entry != nullptr) {
+        *rule = idm_rule{0, oxtest::heap_copy("t"), oxtest::heap_copy("r"), 1, oxtest::one_token(entry->network_id),
+                         entry->local_id != nullptr ? oxtest::mapping_of(entry->local_id) : nullptr};
+    }
+    *id = idm_id{oxtest::heap_copy("t"), oxtest::heap_copy("r"), 1, oxtest::one_token(network_id)};
+    return IDM_OK;
+}
+int32_t cleanup(idm_rule *rule, idm_id *id) { return oxtest::free_rule_and_id(rule, id); }
+
+size_t item_count(const TracePoint &p) {
+    if (*p.items == '\0') return 0;
+    return 1 + static_cast<size_t>(std::count(p.items, p.items + std::strlen(p.items), ','));
+}
+
+// Every routine the table names, on its good and its failure paths.  Each
+// session's files get times of their own, so that every session reads them.
+void session(int64_t mtime) {
+    oxtest::write_file(oxtest::kLocalMap,
+                       "t:!mallory\n"
+                       "t:*=guest   # everyone else\n"
+                       "t:broken line\n"
+                       "other:joe=joe\n"
+                       "\n",
+                       mtime);
+    auto map = [](const char *mnemonic_or_who, const char *who = nullptr) {
+        idm_buffer local{};
+        if (who == nullptr) sec_idm_map_identity("t", mnemonic_or_who, &local);
+        else sec_idm_map_identity(mnemonic_or_who, who, &local);
+        std::free(local.value);
+    };
+    idm_buffer local{};
+    sec_idm_register_translator(IDM_MAPPING_NATIVE, "t", translate, cleanup);
+    for (const char *who : {"joe", "mallory", "stop"}) map(who);
+    map("none", "joe");  // no translator
+    sec_idm_map_identity(nullptr, "joe", &local);
+    sec_idm_register_translator(2, "t", translate, cleanup);
+
+    idm_buffer user{5, const_cast<char *>("root")};
+    uint32_t count = 0;
+    idm_buffer *groups = nullptr;
+    if (sec_idm_get_groups(&user, &count, &groups) == 0) {
+        for (uint32_t i = 0; i < count; ++i) std::free(groups[i].value);
+        std::free(groups);
+    }
+    sec_idm_get_groups(nullptr, &count, &groups);
+
+    // The global files appear, supersede each other and go; the local file
+    // changes within the second it is read in.
+    oxtest::write_file(oxtest::kOptGlobalMap, "t:*=opt\n", mtime);
+    map("joe");
+    oxtest::write_file(oxtest::kVarGlobalMap, "t:*=var\n", mtime);
+    map("joe");
+    oxtest::remove_file(oxtest::kVarGlobalMap);
+    map("joe");
+    oxtest::write_file(oxtest::kLocalMap, "t:joe=joe\n");
+    map("joe");
+    map("joe");
+
+    oxtest::write_file(oxtest::kNodeInfo,
+                       "NODE:\n NAME: a.example a\n ADDRESS: 10.0.0.1\n CLUSTER: c1 c2\n", mtime);
+    cux_set_active_cluster("c1");
+    sec_is_in_any_cluster("a.example");
+    sec_is_in_active_cluster("10.0.0.1");
+    // One fault of the node file each: every error point of the parser.
+    for (const char *text : {"NAME: outside\n", "NODE\n", "NODE:\nNAME a\n", "NODE:\nNAME: a\nADDRESS: 1\nADDRESS: 2\n",
+                             "NODE:\nNAME: a\nADDRESS 1\n", "NODE:\nNAME: a\nADDRESS: 1\nCLUSTER: c\nCLUSTER: d\n",
+                             "NODE:\nNAME: a\nADDRESS: 1\nCLUSTER c\n", "bogus\n", "NODE:\nNAME: a\nNODE:\n"}) {
+        oxtest::write_file(oxtest::kNodeInfo, text, ++mtime);
+        sec_is_in_any_cluster("a.example");
+    }
+
+    // Internal routines' argument checks and the routine-end point.
+    int32_t n = 0;
+    idm_mapfile_entry *entries = nullptr;
+    idm_mapfile_set *set = nullptr;
+    idm__native_get_mapfile_names(&set);
+    idm__native_release_cachef(set);
+    idm__native_get_mapfile_names(nullptr);
+    idm__parse_mapfile(nullptr, "p", stdin, &n, &entries);
+    idm__read_mapfile_entries(nullptr, &n, &entries);
+    idm__native_read_mapfiles(nullptr, nullptr, &n, &entries);
+    idm__native_test_mapfiles(nullptr);
+    idm__trace_routine_end("routine", 5);
+}
+
+struct Setting {
+    const char *label;
+    unsigned char levels[5];  // Error, API, Mapping, Milestone, Diag
+};
+constexpr Setting kSettings[] = {
+    {"API 1", {0, 1, 0, 0, 0}},      {"API 8", {0, 8, 0, 0, 0}},       {"API 2", {0, 2, 0, 0, 0}},
+    {"Error 1", {1, 0, 0, 0, 0}},    {"Diag 1", {0, 0, 0, 0, 1}},      {"Mapping 2", {0, 0, 2, 0, 0}},
+    {"Mapping 8", {0, 0, 8, 0, 0}},  {"Milestone 8", {0, 0, 0, 8, 0}}, {"all 8", {8, 8, 8, 8, 8}},
+};
+
+// Points no session above reaches: allocation failures (the sweeps drive
+// them), a set of a foreign layout version, streams that cannot be opened,
+// a file released by a cancelled pass, tree insertion failures.
+const std::set<int> kUnreached = {
+    tp::kMapfileNamesNoMemory, tp::kReadyNoStream,     tp::kReadyBadArg,       tp::kEntriesGrowFailed,
+    tp::kEntriesNoNetworkCopy, tp::kEntriesNoLocalCopy, tp::kTestFilesBadVersion, tp::kMapfileReleased,
+    tp::kNodeNoMemory,         tp::kNodeNoTreeRecord,   tp::kTreeInsertFailed,
+};
+
+class TracePoints : public oxtest::Test {};
+
+TEST_F(TracePoints, EveryRecordIsARowOfTheTableAtItsLevelsAndEveryRowIsReached) {
+    OXTEST_REQUIRE_NAMESPACE();
+    std::set<int> seen;
+    int64_t mtime = 1000;
+    for (const Setting &s : kSettings) {
+        SCOPED_TRACE(s.label);
+        oxtest::set_trace_levels(s.levels[0], s.levels[1], s.levels[2], s.levels[3], s.levels[4]);
+        session(mtime += 10);
+        for (const oxtest::TraceRecord &r : oxtest::trace_records()) {
+            const TracePoint *p = idm::trace::find_point(r.id);
+            ASSERT_NE(p, nullptr) << "id " << r.id << " is not in the table";
+            EXPECT_TRUE(idm::trace::recorded_at(*p, s.levels)) << p->name << " recorded at a level it does not name";
+            const size_t items = item_count(*p);
+            if (p->id == tp::kRoutineEndName) EXPECT_EQ(r.kind, TRX_STRINGS);
+            else EXPECT_EQ(r.kind, items == 0 ? TRX_ID : TRX_DATA) << p->name;
+            EXPECT_EQ(r.items.size(), items) << p->name;
+            seen.insert(r.id);
+        }
+        oxtest::reset_trace();
+    }
+    for (const TracePoint &p : kTracePoints)
+        EXPECT_NE(seen.count(p.id) + kUnreached.count(p.id), 0u) << p.name << " was never recorded";
+}
+
+TEST_F(TracePoints, NothingIsRecordedWithEveryLevelZero) {
+    OXTEST_REQUIRE_NAMESPACE();
+    oxtest::set_trace_levels(0, 0, 0, 0, 0);
+    session(1000);
+    EXPECT_TRUE(oxtest::trace_records().empty());
+}
+
+TEST_F(TracePoints, TheTableHasOneRowPerIdAndNoLevelsOutsideItsCategory) {
+    std::set<int> ids;
+    for (const TracePoint &p : kTracePoints) {
+        EXPECT_TRUE(ids.insert(p.id).second) << "id " << p.id << " twice";
+        EXPECT_NE(p.levels, 0) << p.name;
+    }
+}
+
+}  // namespace
