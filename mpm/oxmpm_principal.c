@@ -20,7 +20,12 @@
 
 #define EXPORT __attribute__((visibility("default")))
 
-enum { ST_OK = 0, ST_BAD_ID = 38, ST_REFUSED = 39, ST_NO_MEMORY = 12 };
+enum {
+    ST_OK = IDM_OK,
+    ST_BAD_ID = IDM_TRANSLATOR_REJECT,
+    ST_REFUSED = IDM_TRANSLATOR_REFUSED,
+    ST_NO_MEMORY = 12 /* ENOMEM: any other status passes the entry over */
+};
 
 static char mnemonic[] = OXMPM_PRINCIPAL_MNEMONIC;
 
