@@ -134,7 +134,7 @@ void BM_host_translator(benchmark::State &state) {
 
 // The report each passed-over entry makes.
 void BM_report_token_mismatch(benchmark::State &state) {
-    for (auto _ : state) benchmark::DoNotOptimize(idm::report(38, idm::kMsg666, "user17", "user10000"));
+    for (auto _ : state) benchmark::DoNotOptimize(idm::report(idm::kRuleInvalid, idm::kMsg666, "user17", "user10000"));
 }
 
 // Thread CPU time: the derived figures subtract measurements from one
@@ -156,7 +156,7 @@ void outside_calls(const idm_translator *t, const char *id_text, bool reports) {
         idm_rule *rule = &t->rules[t->entries[i].rule_index - 1];
         idm_id id{};
         benchmark::DoNotOptimize(oxmpm_host_translate(nullptr, id_text, rule, &id));
-        if (reports) benchmark::DoNotOptimize(idm::report(38, idm::kMsg666, rule->tokens[0], id.tokens[0]));
+        if (reports) benchmark::DoNotOptimize(idm::report(idm::kRuleInvalid, idm::kMsg666, rule->tokens[0], id.tokens[0]));
         oxmpm_host_cleanup(nullptr, &id);
     }
 }

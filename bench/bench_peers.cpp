@@ -98,6 +98,7 @@ void BM_peer_idm(benchmark::State &state) {
 // the difference.  What is left is the change test (three stat calls), the
 // locks, the rule checks and matching and the result copy.
 void BM_peer_idm_own(benchmark::State &state) {
+    static constexpr int kMsg666Number = 287;  // 2650-666 in set 1 of oxseclib.cat
     static constexpr const char kMsg666[] =
         "2650-666 libox_idm Failure: Unable to find a match between a rule\ntoken (%1$s) and the corresponding id "
         "token (%2$s).\n";
@@ -136,7 +137,7 @@ void BM_peer_idm_own(benchmark::State &state) {
             oxmpm_principal_cleanup(nullptr, &each);
         }
         for (int i = 1; i < n; ++i)
-            benchmark::DoNotOptimize(cu_set_error_1(38, 0, "oxseclib.cat", 1, 287, kMsg666, "user1", id.c_str()));
+            benchmark::DoNotOptimize(cu_set_error_1(IDM_E_RULE, 0, "oxseclib.cat", 1, kMsg666Number, kMsg666, "user1", id.c_str()));
         auto t4 = Clock::now();
         double own = std::chrono::duration<double>((t1 - t0) - (t4 - t2)).count();
         state.SetIterationTime(own > 0 ? own : 0);
