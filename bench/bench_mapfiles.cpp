@@ -20,8 +20,9 @@
 #include <string>
 
 #include "namespace.h"
-#include "oxidm_state.h"
+#include "ox_mss.h"
 #include "oxidm_natfile.h"
+#include "oxidm_state.h"
 
 namespace {
 
