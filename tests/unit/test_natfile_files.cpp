@@ -93,9 +93,8 @@ TEST_F(MapFiles, ChangeTestOfOneFile) {
         oxtest::reset_trace();
         oxtest::set_trace_levels(0, 0, 0, 0, 1);
         EXPECT_EQ(idm__native_test_mapfiles_v1(set, 2, 1), c.result);
-        EXPECT_EQ(set->flags[2], c.flags_after);
-        EXPECT_EQ(set->mtimes[2], c.mtime_after);
-        EXPECT_EQ(set->read_times[2], c.read_time_after);
+        EXPECT_EQ((std::vector<uint32_t>{set->flags[2], set->mtimes[2], set->read_times[2]}),
+                  (std::vector<uint32_t>{c.flags_after, c.mtime_after, c.read_time_after}));
         EXPECT_EQ(oxtest::trace_ids(), c.diag);
     }
     // A set of another layout version is not tested: every file deselected.
@@ -118,9 +117,10 @@ void touch_while_parsing(int id) {
 // Reading passes of one translator.  Each step changes the files or the
 // platform, then asks for a pass; the list is always checked (a pass that
 // changes nothing or fails leaves the caller's list as it was).
-//   L V O: the local, /var global and /opt global file written at a time;
-//   N: the local file with a line more; C: the local file with a cut,
-//   unterminated last line; E: the local file ending in an empty line;  -L: removed;  t=S: the clock;
+//   L@T V@T O@T: the local, /var global and /opt global file written, of
+//   modification time T;  N@T, C@T, E@T: the local file with a line more,
+//   with a cut (unterminated) last line, ending in an empty line;
+//   -L: removed;  t=S: the clock;
 //   open:V=R, time:V=R: the platform's open or time query of V fails with
 //   R (open:- and time:- end it);  lock=R, fdopen=E: every lock fails with
 //   R, every stream opening with errno E (0 ends it);  fifo:V: V is a FIFO,
@@ -175,7 +175,8 @@ const struct {
     {"a file gone before it is opened", {{"L@1000 open:L=21", 37, ""}}},
     // Three lines: 2 touches move one parse, 9 move all three.
     {"a file changed while parsed is parsed again, three times at most",
-     {{"touch=2 L@1000", 0, "l=L"}, {"touch=9 L@1001", 23, "l=L", idm::kMsg655}, {"", 0, "l=L"}}},
+     {{"touch=2 L@1000", 0, "l=L"},
+      {"touch=9 L@1001", 23, "l=L", idm::kMsg655, "idm__parse_mapfile 11 idm__native_read_mapfiles"}, {"", 0, "l=L"}}},
     {"a failed time query deselects every file",
      {{"L@1000 O@1000 time:V=23", 0, ""}, {"time:-", 0, "l=L o=O"}, {"time:L=23", 1, "l=L o=O"}}},
 };
