@@ -102,7 +102,7 @@ TEST_F(MapFiles, ChangeTestOfOneFile) {
     set->flags[0] = P | U | R;
     oxtest::set_trace_levels(1, 0, 0, 0, 0);
     EXPECT_EQ(idm__native_test_mapfiles(set), 1);
-    EXPECT_TRUE(oxtest::reported(23, idm::kMsg655, {"idm__native_test_mapfiles", "23", "[ignored]"}));
+    EXPECT_TRUE(oxtest::reported(idm::kInternal, idm::kMsg655, {"idm__native_test_mapfiles", "23", "[ignored]"}));
     EXPECT_EQ(set->flags[0], P);
     EXPECT_EQ(oxtest::trace_ids().back(), 82);  // the version seen, at the error level
     idm__native_release_cachef(set);
