@@ -49,23 +49,25 @@ TEST(FrontEnd, RegistryReplacesRoutinesAndKeepsCaseDistinctRecords) {
 }
 
 // The API records of the front end and of the native service under it, the
-// only place where the service's two state words (reserved, translators) show.
-TEST(FrontEnd, ApiRecordsAtLevelsOneAndEight) {
+// only place where the service's two state words (reserved, translators) show,
+// also before the service ran at all.
+TEST(FrontEnd, ApiRecordsAtLevelsEightAndOne) {
     idm_buffer out{}, *groups;
     uint32_t count;
     auto run = [&](unsigned char level) {
         oxtest::reset_trace();
         oxtest::set_trace_levels(0, level, 0, 0, 0);
+        sec_idm_register_translator(1, nullptr, translator_a, cleanup_a);  // refused: the service is not called
         sec_idm_register_translator(1, "m", translator_a, cleanup_a);
         sec_idm_map_identity("x", "id", &out);
         sec_idm_get_groups(nullptr, &count, &groups);
         return oxtest::trace_ids();
     };
-    EXPECT_EQ(run(1), (std::vector<int>{88, 148, 149, 103, 106, 91, 93, 108, 111, 96, 98, 101}));
-    EXPECT_EQ(run(8), (std::vector<int>{90, 105, 107, 92, 95, 110, 112, 97, 100, 102}));
+    EXPECT_EQ(run(8), (std::vector<int>{90, 148, 149, 92, 90, 105, 107, 92, 95, 110, 112, 97, 100, 102}));
     const auto r = oxtest::trace_records();
-    EXPECT_EQ(std::vector<int>({r[3].i32(0), r[3].i32(1), r[3].i32(2), r[7].i32(0), r[7].i32(1)}),
-              std::vector<int>({0, 0, 1, 22, 0}));
+    EXPECT_EQ(std::vector<int>({r[3].i32(1), r[3].i32(2), r[7].i32(0), r[7].i32(1), r[7].i32(2), r[11].i32(0),
+                                r[11].i32(1)}), std::vector<int>({0, 0, 0, 0, 1, 22, 0}));
+    EXPECT_EQ(run(1), (std::vector<int>{88, 91, 88, 103, 106, 91, 93, 108, 111, 96, 98, 101}));
 }
 
 }  // namespace
