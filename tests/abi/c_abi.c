@@ -1,15 +1,6 @@
-/* The public header compiled as C: layouts and the prototypes of the seven
- * exported functions as a C program sees them. */
-#include <stddef.h>
-
+/* The public header compiled as C (its layout assertions included) and the
+ * prototypes of the seven exported functions as a C program sees them. */
 #include "oxidm.h"
-
-_Static_assert(sizeof(idm_buffer) == 16, "idm_buffer");
-_Static_assert(sizeof(idm_rule) == 48, "idm_rule");
-_Static_assert(sizeof(idm_id) == 32, "idm_id");
-_Static_assert(sizeof(idm_mapfile_entry) == 40, "entry");
-_Static_assert(offsetof(idm_rule, mapping) == 40, "mapping");
-_Static_assert(offsetof(idm_mapfile_entry, rule_index) == 32, "rule_index");
 
 int c_abi_check(void) {
     int32_t (*reg)(int32_t, const char *, idm_translator_routine, idm_cleanup_routine) = sec_idm_register_translator;
