@@ -63,13 +63,13 @@ TEST(NatmapRules, MatcherAgreesWithReference) {
             const bool m = ref::match(p, t);
             ASSERT_EQ(idm::wildcard_match(p.c_str(), t.c_str()), m) << p << " " << t;
             ASSERT_EQ(idm__native_match_token(p.c_str(), t.c_str()), m ? 0 : 38) << p << " " << t;
-            ASSERT_TRUE(m || reported(38, idm::kMsg666, {p, t}));
+            ASSERT_TRUE(m || reported(idm::kRuleInvalid, idm::kMsg666, {p, t}));
             oxtest::clear_errors();
             ASSERT_EQ(idm__native_match_rgy(p.c_str(), t.c_str()), m ? 0 : 38) << p << " " << t;
-            ASSERT_TRUE(m ? oxtest::nothing_reported() : reported(38, idm::kMsg667, {p, t}));
+            ASSERT_TRUE(m ? oxtest::nothing_reported() : reported(idm::kRuleInvalid, idm::kMsg667, {p, t}));
         }
     EXPECT_EQ(idm__native_match_rgy(nullptr, "x") + idm__native_match_rgy("*", nullptr), 76);
-    EXPECT_TRUE(reported(38, idm::kMsg667, {"*", ""}));
+    EXPECT_TRUE(reported(idm::kRuleInvalid, idm::kMsg667, {"*", ""}));
 }
 
 // Every combination of a few registry types, registries, token lists, mappings
@@ -94,7 +94,7 @@ TEST(NatmapRules, CheckAndApplyAgreeWithReference) {
         oxtest::clear_errors();
         const int32_t status = idm__native_check_rule(&x.r);
         const bool reports_ok = status == 0 ? oxtest::reports_since_clear() == 0
-                                            : oxtest::reports_since_clear() == 1 && reported(38, idm::kMsg662, {});
+                                            : oxtest::reports_since_clear() == 1 && reported(idm::kRuleInvalid, idm::kMsg662, {});
         if ((status != want.status || x.r.rule_state != want.state || !reports_ok) && ++bad <= 5)
             ADD_FAILURE() << "rule " << k << ": " << status << ", state " << x.r.rule_state;
         for (size_t w = 1; status == 0 && (state & 0xFFFFu) == 0 && w < 6 * id_words.size(); ++w) {

@@ -12,7 +12,7 @@
 #include <string>
 
 #include "harness.h"
-#include "oxidm_internal.h"
+#include "oxidm_state.h"
 #include "test_mpm.h"
 
 namespace {
