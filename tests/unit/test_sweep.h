@@ -2,12 +2,15 @@
 // operation fails in turn, until the operation completes without reaching a
 // failure.  Each step must make exactly one 2650-654/658/691 report, of a
 // site listed in the operation's table (message, function, size, status),
-// answer what that row says now and at the next call, leak nothing and
-// leave no lock held.  Every row must be hit by some step, so a site that
-// stops failing, or starts failing elsewhere, is noticed.
+// answer what that row says now and at the next call, leak nothing, leave
+// no lock held and free every block that held an identity or a path zeroed.
+// Every row must be hit by some step, so a site that stops failing, or
+// starts failing elsewhere, is noticed.
 #ifndef OXIDM_TEST_SWEEP_H
 #define OXIDM_TEST_SWEEP_H
 
+#include <algorithm>
+#include <atomic>
 #include <functional>
 #include <set>
 #include <string>
@@ -31,6 +34,12 @@ inline bool no_leaks() {
 #else
     return true;
 #endif
+}
+
+inline std::atomic<int> g_unzeroed{0};
+inline void check_zeroed(const void *p, size_t n) {
+    const auto *b = static_cast<const unsigned char *>(p);
+    if (std::any_of(b, b + n, [](unsigned char c) { return c != 0; })) g_unzeroed.fetch_add(1);
 }
 
 inline bool unlocked(pthread_mutex_t *m) {
@@ -73,6 +82,14 @@ struct Operation {
 
 // Runs the sweep; returns the number of allocations the operation makes.
 inline long run(const Operation &op, std::vector<Row> &rows, long limit = 400) {
+    idm_test_on_secret_free(check_zeroed);
+    struct Off {
+        ~Off() {
+            idm_test_fail_alloc(0);
+            idm_test_on_secret_free(nullptr);
+            EXPECT_EQ(g_unzeroed.exchange(0), 0) << "a block that held an identity or a path was freed unzeroed";
+        }
+    } off;
     for (long n = 1; n <= limit; ++n) {
         SCOPED_TRACE("failing allocation " + std::to_string(n));
         op.prepare(n);

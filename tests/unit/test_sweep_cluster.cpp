@@ -39,10 +39,6 @@ class SweepCluster : public oxtest::Test {
         OXTEST_REQUIRE_NAMESPACE();
         pthread_once(&idm__init_once_block, idm__state_init);
     }
-    void TearDown() override {
-        idm_test_fail_alloc(0);
-        oxtest::Test::TearDown();
-    }
 };
 
 TEST_F(SweepCluster, LoadOfSeveralRecords) {

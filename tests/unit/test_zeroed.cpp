@@ -8,10 +8,9 @@
 #include <unistd.h>
 
 #include <algorithm>
-#include <atomic>
 #include <cstdlib>
+#include <atomic>
 #include <cstring>
-#include <map>
 #include <mutex>
 #include <set>
 #include <string>
@@ -32,8 +31,9 @@ size_t __sanitizer_get_allocated_size(const volatile void *p);
 
 namespace {
 
+using Blocks = std::vector<std::pair<const void *, size_t>>;
 std::mutex g_mutex;
-std::vector<std::pair<const void *, size_t>> g_freed;  // blocks that were all zero
+Blocks g_freed;  // blocks that were all zero
 int g_unzeroed = 0;
 
 void on_secret_free(const void *p, size_t n) {
@@ -45,7 +45,7 @@ void on_secret_free(const void *p, size_t n) {
 
 // The texts of `wanted` (pointer -> length with the NUL) were freed zeroed
 // through the hook, and nothing else but `others` more blocks.
-void expect_routed(const std::map<const void *, size_t> &wanted, size_t others = 0) {
+void expect_routed(const Blocks &wanted, size_t others = 0) {
     std::lock_guard<std::mutex> lock(g_mutex);
     for (const auto &[p, n] : wanted)
         EXPECT_EQ(std::count(g_freed.begin(), g_freed.end(), std::make_pair(p, n)), 1) << "a text not freed zeroed, or twice";
@@ -100,12 +100,12 @@ TEST_F(Zeroed, IdentifiersPathsResultsAndGroupBuffers) {
     idm_buffer local{};
     ASSERT_EQ(sec_idm_map_identity("zr", "zsecretJ0", &local), 0);
     ASSERT_STREQ(local.value, "zsecretL0");
-    idm_translator *record = idm__native_find_translator("zr");
+    const idm_translator *record = idm__native_find_translator("zr");
     ASSERT_EQ(record->entry_count, 7);
-    std::map<const void *, size_t> texts;
+    Blocks texts;
     for (int32_t i = 0; i < record->entry_count; ++i)
         for (const char *t : {record->entries[i].network_id, record->entries[i].local_id})
-            if (t != nullptr) texts[t] = std::strlen(t) + 1;
+            if (t != nullptr) texts.emplace_back(t, std::strlen(t) + 1);
     ASSERT_EQ(texts.size(), 12u);
     expect_routed({});
 
@@ -124,7 +124,7 @@ TEST_F(Zeroed, IdentifiersPathsResultsAndGroupBuffers) {
     idm_mapfile_set *set = nullptr;
     ASSERT_EQ(idm__native_get_mapfile_names(&set), 0);
     texts.clear();
-    for (int32_t i = 0; i < set->count; ++i) texts[set->names[i]] = std::strlen(set->names[i]) + 1;
+    for (int32_t i = 0; i < set->count; ++i) texts.emplace_back(set->names[i], std::strlen(set->names[i]) + 1);
     idm__native_release_cachef(set);
     expect_routed(texts, 4);
 
