@@ -1,10 +1,12 @@
 #!/usr/bin/env python3
-"""Golden cases of the oxidm command (golden.txt): each case is a command
-line "$ ARGS", the exact stdout ("> " lines), stderr ("! " lines) and exit
-status ("= N").  ARGS may start with VAR=value settings and with @nobody
-(run as user 65534, root only).  {t} is a scratch directory holding a copy
-of the examples ({t}/ex) and the trees below; paths under it are written
-{t} in the outputs.  --update rewrites golden.txt from the actual outputs.
+"""Golden cases of the oxidm command, all in golden.txt.  A case is a
+command line "$ ARGS" followed by the exact stdout ("> " lines), stderr
+("! " lines) and exit status ("= N").  ARGS may start with VAR=value
+settings and with @nobody (run as user 65534; skipped unless root).  {t} is
+a scratch directory holding a copy of the examples ({t}/ex) and the files
+given as "% PATH [MODE|fifo]" followed by their lines as "| " lines (a PATH
+ending in "/" is a directory); paths under {t} are written {t} in outputs.
+--update rewrites golden.txt with the actual outputs.
 
 usage: test_cli.py OXIDM EXAMPLES_DIR [--update]
 """
@@ -12,45 +14,29 @@ import os, shlex, shutil, subprocess, sys, tempfile
 
 OXIDM, EXAMPLES = map(os.path.abspath, sys.argv[1:3])
 GOLDEN = os.path.join(os.path.dirname(os.path.abspath(__file__)), "golden.txt")
-TREES = {  # relative path: text (None: a FIFO); modes 644/755 unless named in MODES
-    "long/var/ox/cfg/oxsec_map.local": "# head\nprinc:" + "a" * 1500 + "@R=x\nprinc:!c@R\nprinc:*@R=y\n",
-    "walk/var/ox/cfg/oxsec_map.local": "".join(
-        f"host:!u{i}@n{i}\n" if i % 7 == 3 else f"host:u{i}@n{i}=local{i}\n" for i in range(20)),
-    "walk/var/ox/cfg/oxsec_map.global": "".join(f"host:u{i}@n{i}=global{i}\n" for i in range(40)) + "host:*@*=guest\n",
-    "opt/opt/helvo/cfg/oxsec_map.global": "princ:*@*=fromopt\n",
-    "both/opt/helvo/cfg/oxsec_map.global": "princ:*@*=fromopt\n",
-    "both/var/ox/cfg/oxsec_map.global": "princ:*@*=fromvar\n",
-    "rules/var/ox/cfg/oxsec_map.local": "# rules\nprinc:joe@OTHER.ORG=joe\nprinc:broken\n\nprinc:*@EXAMPLE.ORG=*\n",
-    "rules/var/ox/cfg/oxsec_map.global": "princ:!a@R\nprinc:bad\n",
-    "badnode/var/ox/cfg/oxsec.nodeinfo": "NODE:\nNAME: a\n",
-    "badnode/var/ox/cfg/active_cluster": "x\n",
-    "noactive/var/ox/cfg/oxsec.nodeinfo": "NODE:\nNAME: a\nCLUSTER: c\n",
-    "hosts/var/ox/cfg/oxsec.nodeinfo": "".join(
-        f"NODE:\n NAME: n{i}\n ADDRESS: 10.9.0.{i}\n CLUSTER: c{i % 3}\n" for i in range(9)),
-    "hosts/var/ox/cfg/active_cluster": "c1\n",
-    "check/open/map": "host:*@node1=root\nhost:ann@node1=ann\n",
-    "check/bad.nodeinfo": "NODE:\nNAME: a\nCLUSTER: c\nNAME: b\nNODE:\nbogus\nNODE:\nNAME: c\n",
-    "check/warn.nodeinfo": "NODE:\nNAME: a 10.1.1.1\nCLUSTER: c # old\nNODE:\nNAME: a\nCLUSTER: d\n",
-    "check/fifo": None,
-    "empty/var/ox/cfg/.keep": "",
-}
-MODES = {"check/open": 0o777, "check/open/map": 0o666}
 
 
-def make_tree(t):
+def make_tree(t, lines):
     shutil.copytree(EXAMPLES, os.path.join(t, "ex"))
-    for rel, text in TREES.items():
-        path = os.path.join(t, rel)
-        os.makedirs(os.path.dirname(path), exist_ok=True)
+    modes, files, path = {}, {}, None
+    for line in lines:
+        if line.startswith("% "):
+            path, *mode = line[2:].split()
+            modes[path.rstrip("/")] = mode[0] if mode else None
+            files[path] = None if mode == ["fifo"] else ""
+        elif line[:1] == "|" and path is not None:
+            files[path] += line[2:] + "\n"
+    for rel, text in files.items():
+        full = os.path.join(t, rel)
+        os.makedirs(os.path.dirname(full), exist_ok=True)
         if text is None:
-            os.mkfifo(path)
-        else:
-            with open(path, "w") as f:
-                f.write(text)
-    for d, dirs, files in os.walk(t):
-        for name in dirs + files:
-            p = os.path.join(d, name)
-            os.chmod(p, MODES.get(os.path.relpath(p, t), 0o755 if name in dirs else 0o644))
+            os.mkfifo(full)
+        elif not rel.endswith("/"):
+            open(full, "w").write(text)
+    for d, dirs, names in os.walk(t):
+        for name in dirs + names:
+            mode = modes.get(os.path.relpath(os.path.join(d, name), t))
+            os.chmod(os.path.join(d, name), int(mode, 8) if mode and mode != "fifo" else 0o755 if name in dirs else 0o644)
     os.chmod(t, 0o755)
 
 
@@ -66,15 +52,14 @@ def run(line, t):
             return None
         cmd = ["setpriv", "--reuid=65534", "--regid=65534", "--clear-groups", OXIDM, *args[1:]]
     p = subprocess.run(cmd, capture_output=True, text=True, env=env, timeout=120)
-    lines = [(">", l) for l in p.stdout.replace(t, "{t}").splitlines()]
-    lines += [("!", l) for l in p.stderr.replace(t, "{t}").splitlines()]
-    return [f"{k} {l}".rstrip() for k, l in lines] + [f"= {p.returncode}"]
+    out = [f"> {l}".rstrip() for l in p.stdout.replace(t, "{t}").splitlines()]
+    return out + [f"! {l}".rstrip() for l in p.stderr.replace(t, "{t}").splitlines()] + [f"= {p.returncode}"]
 
 
 def main():
     host_had_cfg = os.path.exists("/var/ox/cfg")
+    lines = open(GOLDEN).read().splitlines()
     t = tempfile.mkdtemp(prefix="oxidm-cli-")
-    make_tree(t)
     out, failed, case = [], [], {"command": None, "expected": []}
 
     def finish():
@@ -88,7 +73,8 @@ def main():
         case.update(command=None, expected=[])
 
     try:
-        for line in open(GOLDEN).read().splitlines():
+        make_tree(t, lines)
+        for line in lines:
             if case["command"] is not None and line[:1] and line[:1] in ">!=":
                 case["expected"].append(line)
                 continue
