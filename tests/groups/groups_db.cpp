@@ -13,53 +13,40 @@
 
 #include "oxidm.h"
 
-// ---------------------------------------------------------------------------
-// Interposition.  The library is linked into this program statically, so its
-// calls of getgrent_r and endgrent bind to the definitions below, which pass
-// on to the next definition in the lookup order: nss_wrapper's (behind the
-// ASan runtime's interceptor in the ASan build).
-// ---------------------------------------------------------------------------
-
+// The library is linked in statically, so its calls of getgrent_r and
+// endgrent bind to these definitions, which pass on to the next one in the
+// lookup order: nss_wrapper's (behind the ASan interceptor in that build).
 namespace {
 
-std::atomic<int> g_getgrent_calls{0};
-std::atomic<int> g_endgrent_calls{0};
-std::atomic<int> g_fail_at{0};
-std::atomic<int> g_fail_times{0};
-std::atomic<int> g_fail_style{0};
-std::atomic<int> g_fail_error{0};
+std::atomic<int> g_getgrent{0}, g_endgrent{0}, g_fail_at{0}, g_fail_times{0}, g_fail_errno{0}, g_fail_error{0};
 std::atomic<int> g_block_at{0};
-std::atomic<bool> g_block_entered{false};
+std::atomic<bool> g_blocked{false};
 
 template <class Fn>
 Fn next_definition(const char *name) {
     void *symbol = dlsym(RTLD_NEXT, name);
     if (symbol == nullptr) std::abort();
-    Fn fn;
-    std::memcpy(&fn, &symbol, sizeof fn);
-    return fn;
+    return reinterpret_cast<Fn>(symbol);
 }
 
 }  // namespace
 
 // No ASan redzones in this frame: a cancellation unwinds through it without
-// ASan's help, and poisoned stack left behind would trip ASan's own clean-up
-// in the library's destructors.
+// ASan's help, and poisoned stack left behind would trip ASan's clean-up in
+// the library's destructors.
 extern "C" __attribute__((no_sanitize("address"))) int getgrent_r(struct group *__restrict entry,
                                                                    char *__restrict buffer, size_t size,
                                                                    struct group **__restrict result) {
-    using Fn = int (*)(struct group *, char *, size_t, struct group **);
-    static const Fn next = next_definition<Fn>("getgrent_r");
-    int call = g_getgrent_calls.fetch_add(1) + 1;
-    int at = g_fail_at.load();
+    static const auto next = next_definition<int (*)(group *, char *, size_t, group **)>("getgrent_r");
+    const int call = g_getgrent.fetch_add(1) + 1, at = g_fail_at.load();
     if (at > 0 && call >= at && call < at + g_fail_times.load()) {
         *result = nullptr;
-        if (g_fail_style.load() == static_cast<int>(groupstest::Style::kResult)) return g_fail_error.load();
+        if (g_fail_errno.load() == 0) return g_fail_error.load();
         errno = g_fail_error.load();
         return -1;
     }
     if (call == g_block_at.load()) {
-        g_block_entered.store(true);
+        g_blocked.store(true);
         // Cancellation acts in pthread_testcancel only, never inside the
         // sleep: a sanitizer's interceptor frame that a cancellation unwinds
         // through loses track of the thread's later lock operations.
@@ -75,76 +62,30 @@ extern "C" __attribute__((no_sanitize("address"))) int getgrent_r(struct group *
 }
 
 extern "C" void endgrent(void) {
-    static const auto next = next_definition<void (*)(void)>("endgrent");
-    g_endgrent_calls.fetch_add(1);
+    static const auto next = next_definition<void (*)()>("endgrent");
+    g_endgrent.fetch_add(1);
     next();
 }
 
 namespace groupstest {
 
 void inject_getgrent_error(int at, int times, Style style, int error) {
-    g_fail_style.store(static_cast<int>(style));
+    g_fail_errno.store(style == Style::kErrno);
     g_fail_error.store(error);
     g_fail_times.store(times);
-    g_fail_at.store(at + g_getgrent_calls.load());
+    g_fail_at.store(at + g_getgrent.load());
 }
-
 void block_getgrent_at(int at) {
-    g_block_entered.store(false);
-    g_block_at.store(at + g_getgrent_calls.load());
+    g_blocked.store(false);
+    g_block_at.store(at + g_getgrent.load());
 }
-
-bool block_entered() { return g_block_entered.load(); }
-int getgrent_calls() { return g_getgrent_calls.load(); }
-int endgrent_calls() { return g_endgrent_calls.load(); }
-
+bool block_entered() { return g_blocked.load(); }
+int getgrent_calls() { return g_getgrent.load(); }
+int endgrent_calls() { return g_endgrent.load(); }
 void reset_interposition() {
-    g_fail_at.store(0);
-    g_block_at.store(0);
-    g_block_entered.store(false);
-    g_getgrent_calls.store(0);
-    g_endgrent_calls.store(0);
+    for (auto *v : {&g_fail_at, &g_block_at, &g_getgrent, &g_endgrent}) v->store(0);
+    g_blocked.store(false);
 }
-
-// ---------------------------------------------------------------------------
-// Database files
-// ---------------------------------------------------------------------------
-
-namespace {
-
-std::string g_dir;  // removed at exit when it is not in the private /tmp
-
-void remove_db_dir() {
-    std::string passwd = g_dir + "/passwd", group = g_dir + "/group";
-    unlink(passwd.c_str());
-    unlink(group.c_str());
-    rmdir(g_dir.c_str());
-}
-
-// nss_wrapper reads NSS_WRAPPER_PASSWD and NSS_WRAPPER_GROUP once, at its
-// first lookup, and reloads a file whenever it changed.  Inside the private
-// namespace /tmp belongs to this process, so the fixed paths set by ctest
-// are private; elsewhere (no namespace) the process makes its own directory
-// and points the variables at it before the first lookup.
-void prepare_db_dir() {
-    if (!g_dir.empty()) return;
-    const char *passwd = std::getenv("NSS_WRAPPER_PASSWD");
-    const char *group = std::getenv("NSS_WRAPPER_GROUP");
-    if (oxtest::in_private_namespace() && passwd != nullptr && group != nullptr) {
-        std::string dir = std::string(passwd).substr(0, std::string(passwd).rfind('/'));
-        mkdir(dir.c_str(), 0755);
-        g_dir = dir;
-        return;
-    }
-    char tmpl[] = "/tmp/oxidm-groups-XXXXXX";
-    if (mkdtemp(tmpl) == nullptr) std::abort();
-    g_dir = tmpl;
-    setenv("NSS_WRAPPER_PASSWD", (g_dir + "/passwd").c_str(), 1);
-    setenv("NSS_WRAPPER_GROUP", (g_dir + "/group").c_str(), 1);
-    std::atexit(remove_db_dir);
-}
-
-}  // namespace
 
 void write_db(const std::string &passwd, const std::string &group) {
     oxtest::write_file(std::getenv("NSS_WRAPPER_PASSWD"), passwd);
@@ -162,10 +103,8 @@ Result get_groups(const char *user) {
         return r;
     }
     for (uint32_t i = 0; i < count; ++i) {
-        EXPECT_NE(list[i].value, nullptr);
-        if (list[i].value == nullptr) continue;
-        EXPECT_EQ(list[i].length, std::strlen(list[i].value) + 1) << list[i].value;
-        r.groups.emplace_back(list[i].value);
+        EXPECT_TRUE(list[i].value != nullptr && list[i].length == std::strlen(list[i].value) + 1);
+        r.groups.emplace_back(list[i].value != nullptr ? list[i].value : "(null)");
         std::free(list[i].value);
     }
     std::free(list);
@@ -174,11 +113,13 @@ Result get_groups(const char *user) {
 
 void Fixture::SetUp() {
     oxtest::Test::SetUp();
-    // RTLD_NOLOAD: only asks whether the preloaded library is there.
-    void *wrapper = dlopen("libnss_wrapper.so", RTLD_LAZY | RTLD_NOLOAD);
-    ASSERT_NE(wrapper, nullptr) << "libnss_wrapper.so is not preloaded: run this program through ctest";
+    OXTEST_REQUIRE_NAMESPACE();
+    void *wrapper = dlopen("libnss_wrapper.so", RTLD_LAZY | RTLD_NOLOAD);  // only asks whether it is loaded
+    ASSERT_TRUE(wrapper != nullptr && std::getenv("NSS_WRAPPER_GROUP") != nullptr)
+        << "libnss_wrapper.so is not preloaded: run this program through ctest";
     dlclose(wrapper);
-    prepare_db_dir();
+    const std::string dir = std::getenv("NSS_WRAPPER_GROUP");
+    mkdir(dir.substr(0, dir.rfind('/')).c_str(), 0755);
     reset_interposition();
 }
 

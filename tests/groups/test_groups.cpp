@@ -1,262 +1,175 @@
 // Group membership lookups (sec_idm_get_groups) against nss_wrapper
-// databases: membership rules, failure rows, enumeration errors, allocation
-// failures at every site, trace points.
+// databases: one table of users and databases -> groups, or the failure
+// reported once with status 15 and empty outputs (getgrent_r errors are
+// injected between the library and nss_wrapper); the precedence of
+// failures; and the allocation-failure sweep of a whole lookup.
 #include <unistd.h>
 
 #include <cerrno>
+#include <chrono>
+#include <future>
 #include <string>
 #include <vector>
 
+#include "../unit/test_sweep.h"
 #include "groups_db.h"
-#include "oxidm.h"
-
-using groupstest::get_groups;
-using groupstest::Style;
-using groupstest::write_db;
-using Names = std::vector<std::string>;
+#include "oxidm_internal.h"
 
 namespace {
 
-constexpr int kMsg654 = 275, kMsg698 = 323, kMsg699 = 324, kMsg700 = 325;
+using groupstest::Style;
+using oxtest::num;
 
 // Primary group id 4294967295 is -1: no primary group.
-const char kPasswd[] =
-    "alice:x:1000:100:Alice:/home/alice:/bin/sh\n"
-    "bob:x:1001:200::/home/bob:/bin/sh\n"
-    "carol:x:1002:4294967295::/home/carol:/bin/sh\n"
-    "dave:x:1003:300::/:/bin/sh\n"
-    "erin:x:1004:4294967295::/:/bin/sh\n"
-    "frank:x:1005:999::/:/bin/sh\n"
+const std::string kPasswd =
+    "alice:x:1000:100::/:/bin/sh\nbob:x:1001:200::/:/bin/sh\ncarol:x:1002:4294967295::/:/bin/sh\n"
+    "dave:x:1003:300::/:/bin/sh\nerin:x:1004:4294967295::/:/bin/sh\nfrank:x:1005:999::/:/bin/sh\n"
     "gina:x:1006:504::/:/bin/sh\n";
-
 // Enumeration order deliberately differs from name and id order.
-const char kGroup[] =
-    "zeta:x:500:alice,bob\n"
-    "users:x:100:alice,carol\n"
-    "twice:x:501:carol,alice,carol\n"
-    "case:x:502:Alice,ALICE,bob\n"
-    "prefix:x:503:alicex,alic,xalice\n"
-    "empty:x:504:\n"
-    "staff:x:200:\n"
-    "alpha:x:505:alice,dave\n"
-    "solo:x:300:\n";
+const std::string kGroup =
+    "zeta:x:500:alice,bob\nusers:x:100:alice,carol\ntwice:x:501:carol,alice,carol\ncase:x:502:Alice,ALICE,bob\n"
+    "prefix:x:503:alicex,alic,xalice\nempty:x:504:\nstaff:x:200:\nalpha:x:505:alice,dave\nsolo:x:300:\n";
+
+struct Row {
+    const char *label;
+    const char *user;
+    std::vector<std::string> groups;  // when status is 0
+    int msgno = 0;                    // else: the one report, status 15
+    std::string insert = "";
+    struct {
+        int at = 0, times = 1;  // getgrent_r calls that fail (0: none)
+        Style style = Style::kResult;
+        int error = 0;
+    } inject = {};
+    std::string passwd = kPasswd, group = kGroup;
+};
 
 class Groups : public groupstest::Fixture {};
 
-// ---- membership ----
-
-struct MembershipRow {
-    const char *label;
-    const char *user;
-    Names expected;
-};
-
-TEST_F(Groups, MembershipFollowsPrimaryThenEnumerationOrder) {
-    const MembershipRow rows[] = {
-        {"primary group also lists the user: listed once, first", "alice", {"users", "zeta", "twice", "alpha"}},
+TEST_F(Groups, UsersToGroupsOrTheFailure) {
+    const long gr = sysconf(_SC_GETGR_R_SIZE_MAX), pw = sysconf(_SC_GETPW_R_SIZE_MAX);
+    ASSERT_GT(gr, 0);
+    ASSERT_GT(pw, 0);
+    // Entries just over the buffers: there is no retry with a larger buffer.
+    const std::string long_gecos(static_cast<size_t>(2 * pw), 'g');
+    std::string members = "x";
+    while (members.size() < static_cast<size_t>(gr)) members += ",member";
+    const std::string small = "kim:x:1010:700::/:/bin/sh\nlee:x:1011:701::/:/bin/sh\n";
+    const std::vector<std::string> all = {"users", "zeta", "twice", "alpha"}, first_two = {"users", "zeta"};
+    const Row rows[] = {
+        {"primary group also lists the user: listed once, first", "alice", all},
         {"member names compare exactly (letter case, prefixes)", "bob", {"staff", "zeta", "case"}},
         {"primary id -1; a group naming the user twice is listed twice", "carol", {"users", "twice", "twice"}},
-        {"primary group appears after the member group", "dave", {"solo", "alpha"}},
+        {"primary group after the member group in the file", "dave", {"solo", "alpha"}},
         {"primary id -1 and no group: empty result", "erin", {}},
         {"no group lists the user: primary only", "gina", {"empty"}},
+        {"unknown user", "nobody", {}, idm::kMsg698, "nobody"},
+        {"user names compare exactly", "Alice", {}, idm::kMsg698, "Alice"},
+        {"primary group missing", "frank", {}, idm::kMsg699, "999"},
+        {"user entry larger than its buffer", "hank", {}, idm::kMsg698, "hank", {},
+         "hank:x:1009:100:" + long_gecos + ":/:/bin/sh\n"},
+        {"primary group entry larger than its buffer", "kim", {}, idm::kMsg699, "700", {}, small,
+         "big:x:700:" + members + "\n"},
+        {"scanned group larger than the buffer: ERANGE", "lee", {}, idm::kMsg700, std::to_string(ERANGE), {}, small,
+         "own:x:701:\nlisted:x:702:lee\nbig:x:703:" + members + "\nlater:x:704:lee\n"},
+        {"EINTR as result: repeated in place", "alice", all, 0, "", {2, 3, Style::kResult, EINTR}},
+        {"EINTR in errno with -1: repeated in place", "alice", all, 0, "", {4, 2, Style::kErrno, EINTR}},
+        {"EINTR on the first call", "alice", all, 0, "", {1, 1, Style::kResult, EINTR}},
+        {"ENOENT as result ends the scan", "alice", first_two, 0, "", {3, 1, Style::kResult, ENOENT}},
+        {"ENOENT in errno ends the scan", "alice", first_two, 0, "", {3, 1, Style::kErrno, ENOENT}},
+        {"-1 with errno 0 ends the scan", "alice", first_two, 0, "", {3, 1, Style::kErrno, 0}},
+        {"EIO as result fails", "alice", {}, idm::kMsg700, std::to_string(EIO), {3, 1, Style::kResult, EIO}},
+        {"EIO in errno fails", "alice", {}, idm::kMsg700, std::to_string(EIO), {5, 1, Style::kErrno, EIO}},
+        {"EACCES on the first call fails", "alice", {}, idm::kMsg700, std::to_string(EACCES),
+         {1, 1, Style::kResult, EACCES}},
     };
-    write_db(kPasswd, kGroup);
-    for (const MembershipRow &row : rows) {
+    for (const Row &row : rows) {
         SCOPED_TRACE(row.label);
-        oxtest::clear_errors();
-        int endgrent_before = groupstest::endgrent_calls();
-        groupstest::Result r = get_groups(row.user);
-        EXPECT_EQ(r.status, 0);
-        EXPECT_EQ(r.groups, row.expected);
-        EXPECT_TRUE(oxtest::nothing_reported());
-        EXPECT_EQ(groupstest::endgrent_calls() - endgrent_before, 1) << "enumeration closed once per scan";
-    }
-}
-
-// ---- failure rows ----
-
-struct FailureRow {
-    const char *label;
-    std::string passwd;
-    std::string group;
-    const char *user;
-    int msgno;
-    std::vector<std::string> inserts;
-};
-
-TEST_F(Groups, FailuresReportOnceAndLeaveEmptyOutputs) {
-    const long gr_size = sysconf(_SC_GETGR_R_SIZE_MAX);
-    const long pw_size = sysconf(_SC_GETPW_R_SIZE_MAX);
-    ASSERT_GT(gr_size, 0);
-    ASSERT_GT(pw_size, 0);
-    // Entries just over the buffers: no retry with a larger buffer.
-    const std::string long_gecos(static_cast<size_t>(2 * pw_size), 'g');
-    std::string long_members = "x";
-    while (long_members.size() < static_cast<size_t>(gr_size)) long_members += ",member";
-    const std::string small_passwd = "kim:x:1010:700::/:/bin/sh\nlee:x:1011:701::/:/bin/sh\n";
-
-    const FailureRow rows[] = {
-        {"unknown user", kPasswd, kGroup, "nobody", kMsg698, {"nobody"}},
-        {"user names compare exactly", kPasswd, kGroup, "Alice", kMsg698, {"Alice"}},
-        {"primary group missing", kPasswd, kGroup, "frank", kMsg699, {"999"}},
-        {"user entry larger than its buffer", "hank:x:1009:100:" + long_gecos + ":/:/bin/sh\n", kGroup, "hank",
-         kMsg698, {"hank"}},
-        {"primary group entry larger than its buffer", small_passwd, "big:x:700:" + long_members + "\n", "kim",
-         kMsg699, {"700"}},
-        {"scanned group entry larger than the buffer: getgrent_r fails with ERANGE", small_passwd,
-         "own:x:701:\nlisted:x:702:lee\nbig:x:703:" + long_members + "\nlater:x:704:lee\n", "lee", kMsg700,
-         {std::to_string(ERANGE)}},
-    };
-    for (const FailureRow &row : rows) {
-        SCOPED_TRACE(row.label);
-        write_db(row.passwd, row.group);
-        oxtest::clear_errors();
-        groupstest::Result r = get_groups(row.user);
-        EXPECT_EQ(r.status, 15);
-        EXPECT_TRUE(oxtest::reported(15, row.msgno, row.inserts));
-        EXPECT_EQ(oxtest::reports_since_clear(), 1u);
-    }
-}
-
-// ---- enumeration errors (interposed getgrent_r) ----
-
-struct EnumerationRow {
-    const char *label;
-    int at;  // first failing getgrent_r call of the scan
-    int times;
-    Style style;
-    int error;
-    int status;
-    std::vector<std::string> inserts;  // of 2650-700 when status is 15
-    Names expected;                    // when status is 0
-};
-
-TEST_F(Groups, EnumerationErrorsRetryEndOrFail) {
-    const Names all = {"users", "zeta", "twice", "alpha"};
-    const EnumerationRow rows[] = {
-        {"EINTR as result: repeated in place", 2, 3, Style::kResult, EINTR, 0, {}, all},
-        {"EINTR in errno with -1: repeated in place", 4, 2, Style::kErrno, EINTR, 0, {}, all},
-        {"EINTR on the first call", 1, 1, Style::kResult, EINTR, 0, {}, all},
-        {"ENOENT as result ends the scan", 3, 1, Style::kResult, ENOENT, 0, {}, {"users", "zeta"}},
-        {"ENOENT in errno ends the scan", 3, 1, Style::kErrno, ENOENT, 0, {}, {"users", "zeta"}},
-        {"-1 with errno 0 ends the scan", 3, 1, Style::kErrno, 0, 0, {}, {"users", "zeta"}},
-        {"EIO as result fails", 3, 1, Style::kResult, EIO, 15, {std::to_string(EIO)}, {}},
-        {"EIO in errno fails", 5, 1, Style::kErrno, EIO, 15, {std::to_string(EIO)}, {}},
-        {"EACCES on the first call fails", 1, 1, Style::kResult, EACCES, 15, {std::to_string(EACCES)}, {}},
-    };
-    write_db(kPasswd, kGroup);
-    for (const EnumerationRow &row : rows) {
-        SCOPED_TRACE(row.label);
+        groupstest::write_db(row.passwd, row.group);
         oxtest::clear_errors();
         groupstest::reset_interposition();
-        groupstest::inject_getgrent_error(row.at, row.times, row.style, row.error);
-        groupstest::Result r = get_groups("alice");
-        EXPECT_EQ(r.status, row.status);
-        if (row.status == 0) {
-            EXPECT_EQ(r.groups, row.expected);
+        if (row.inject.at > 0)
+            groupstest::inject_getgrent_error(row.inject.at, row.inject.times, row.inject.style, row.inject.error);
+        const groupstest::Result r = groupstest::get_groups(row.user);
+        EXPECT_EQ(r.groups, row.groups);
+        if (row.msgno == 0) {
+            EXPECT_EQ(r.status, 0);
             EXPECT_TRUE(oxtest::nothing_reported());
         } else {
-            EXPECT_TRUE(oxtest::reported(15, kMsg700, row.inserts));
+            EXPECT_EQ(r.status, 15);
+            EXPECT_TRUE(oxtest::reported(15, row.msgno, {row.insert}));
             EXPECT_EQ(oxtest::reports_since_clear(), 1u);
         }
-        EXPECT_EQ(groupstest::endgrent_calls(), 1);
-    }
-    // Nothing left behind: the next scan is complete.
-    groupstest::reset_interposition();
-    EXPECT_EQ(get_groups("alice").groups, all);
-}
-
-// ---- allocation failures ----
-
-struct AllocationRow {
-    const char *label;
-    const char *user;
-    std::vector<long> sizes;  // bytes requested at each allocation site, in order
-};
-
-// Every allocation of the call fails once, in turn: status 6 with the size
-// requested, count 0 and null array, nothing leaked (ASan/LSan), and the
-// call after it works.
-TEST_F(Groups, EachAllocationFailureReportsItsSize) {
-    const long pw = sysconf(_SC_GETPW_R_SIZE_MAX);
-    const long gr = sysconf(_SC_GETGR_R_SIZE_MAX);
-    const long element = sizeof(idm_buffer);
-    const AllocationRow rows[] = {
-        {"primary group, then appends that grow the array",
-         "alice",
-         {2 * pw, gr, element, 6 /* users */, gr, 2 * element, 5 /* zeta */, 3 * element, 6 /* twice */,
-          4 * element, 6 /* alpha */}},
-        {"no primary group: the first append makes the array",
-         "carol",
-         {2 * pw, gr, element, 6 /* users */, 2 * element, 6 /* twice */, 3 * element, 6 /* twice */}},
-    };
-    write_db(kPasswd, kGroup);
-    ASSERT_EQ(get_groups("alice").status, 0);  // once-controls run outside the count
-    for (const AllocationRow &row : rows) {
-        SCOPED_TRACE(row.label);
-        for (size_t site = 0; site < row.sizes.size(); ++site) {
-            SCOPED_TRACE("allocation " + std::to_string(site + 1));
-            oxtest::clear_errors();
-            idm_test_fail_alloc(static_cast<long>(site) + 1);
-            groupstest::Result r = get_groups(row.user);
-            EXPECT_TRUE(idm_test_alloc_fired());
-            EXPECT_EQ(r.status, 6);
-            EXPECT_TRUE(oxtest::reported(6, kMsg654, {"idm__native_get_groups", std::to_string(row.sizes[site])}));
-            EXPECT_EQ(oxtest::reports_since_clear(), 1u);
+        // A scan (there is one once the user and the primary group are known)
+        // closes the enumeration once; the next scan is whole again.
+        EXPECT_EQ(groupstest::endgrent_calls(), row.msgno == idm::kMsg698 || row.msgno == idm::kMsg699 ? 0 : 1);
+        groupstest::reset_interposition();
+        if (row.inject.at > 0) {
+            EXPECT_EQ(groupstest::get_groups("alice").groups, all);
         }
-        idm_test_fail_alloc(static_cast<long>(row.sizes.size()) + 1);
-        long before = idm_test_alloc_calls();
-        EXPECT_EQ(get_groups(row.user).status, 0);
-        EXPECT_FALSE(idm_test_alloc_fired()) << "more allocation sites than listed";
-        EXPECT_EQ(idm_test_alloc_calls() - before, static_cast<long>(row.sizes.size()));
-        idm_test_fail_alloc(0);
     }
 }
 
 // An append failure lets the scan go on; a later enumeration failure is the
 // last failure recorded and gives the status.
 TEST_F(Groups, LastFailureGivesTheStatus) {
-    write_db(kPasswd, kGroup);
-    ASSERT_EQ(get_groups("alice").status, 0);
+    groupstest::write_db(kPasswd, kGroup);
+    ASSERT_EQ(groupstest::get_groups("alice").status, 0);  // once-controls outside the count
     oxtest::clear_errors();
     groupstest::reset_interposition();
     idm_test_fail_alloc(6);                                        // growing the array for "zeta", 1st group
     groupstest::inject_getgrent_error(9, 1, Style::kResult, EIO);  // in place of "solo", 9th group
-    groupstest::Result r = get_groups("alice");
-    EXPECT_EQ(r.status, 15);
-    EXPECT_EQ(oxtest::reports_since_clear(), 2u);
-    EXPECT_TRUE(oxtest::reported(15, kMsg700, {std::to_string(EIO)}));
-    EXPECT_EQ(groupstest::getgrent_calls(), 9) << "the scan went on after the append failure";
+    EXPECT_EQ(groupstest::get_groups("alice").status, 15);
     idm_test_fail_alloc(0);
+    EXPECT_EQ(oxtest::reports_since_clear(), 2u);
+    EXPECT_TRUE(oxtest::reported(15, idm::kMsg700, {std::to_string(EIO)}));
+    EXPECT_EQ(groupstest::getgrent_calls(), 9) << "the scan went on after the append failure";
 }
 
-// ---- trace ----
+std::string answer(const groupstest::Result &r) {
+    std::string s = std::to_string(r.status);
+    for (const std::string &g : r.groups) s += " " + g;
+    return s;
+}
 
-TEST_F(Groups, TracePoints) {
-    write_db(kPasswd, kGroup);
-    ASSERT_EQ(get_groups("alice").status, 0);  // the library's initialisation traces on its own
-    oxtest::set_trace_levels(0, 1, 0, 0, 0);
-    ASSERT_EQ(get_groups("alice").status, 0);
-    EXPECT_EQ(oxtest::trace_ids(), (std::vector<int>{98, 113, 116, 101}));
+// Every allocation of a lookup for a user in a dozen groups fails in turn
+// (2650-654 with the size of an allocation of the lookup, status 6, empty
+// outputs); the scan lock is free afterwards and the next lookup is whole.
+TEST_F(Groups, SweepEveryAllocationOfALookup) {
+    // Primary group g3000, then twelve groups of growing name length among
+    // groups of others; the 7th names the user twice.
+    std::string group = "g3000:x:3000:many\n", right = "0 g3000";
+    for (int i = 1; i <= 12; ++i) {
+        const std::string name = "group-" + std::string(i, 'x');
+        group += num("other", i) + num(":x:", 3100 + i) + ":someone\n" + name + num(":x:", 3000 + i) + ":a,many" +
+                 (i == 7 ? ",many" : "") + ",b\n";
+        right += " " + name + (i == 7 ? " " + name : "");
+    }
+    groupstest::write_db("many:x:2000:3000::/:/bin/sh\nnone:x:2001:4294967295::/:/bin/sh\n", group);
+    ASSERT_EQ(answer(groupstest::get_groups("many")), right);  // once-controls outside the count
 
-    oxtest::reset_trace();
-    oxtest::set_trace_levels(0, 8, 0, 0, 0);
-    idm_buffer user{7, const_cast<char *>("nobody")};
-    uint32_t count = 0;
-    idm_buffer *list = nullptr;
-    ASSERT_EQ(sec_idm_get_groups(&user, &count, &list), 15);
-    std::vector<oxtest::TraceRecord> records = oxtest::trace_records();
-    ASSERT_EQ(records.size(), 4u);
-    EXPECT_EQ(records[0].id, 100);
-    EXPECT_EQ(records[1].id, 115);
-    ASSERT_EQ(records[1].items.size(), 3u);
-    EXPECT_EQ(records[1].u64(0), reinterpret_cast<uintptr_t>(&user));
-    EXPECT_EQ(records[1].u64(1), reinterpret_cast<uintptr_t>(&count));
-    EXPECT_EQ(records[1].u64(2), reinterpret_cast<uintptr_t>(&list));
-    EXPECT_EQ(records[2].id, 117);
-    ASSERT_EQ(records[2].items.size(), 1u);
-    EXPECT_EQ(records[2].i32(0), 15);
-    EXPECT_EQ(records[3].id, 102);
+    const long pw = sysconf(_SC_GETPW_R_SIZE_MAX), gr = sysconf(_SC_GETGR_R_SIZE_MAX);
+    std::set<std::string> sizes{std::to_string(2 * pw), std::to_string(gr), "6"};  // buffers, "g3000"
+    for (size_t i = 1; i <= 14; ++i) sizes.insert(std::to_string(i * sizeof(idm_buffer)));
+    for (size_t i = 1; i <= 12; ++i) sizes.insert(std::to_string(7 + i));
+    std::vector<sweep::Row> rows = {{"any allocation", idm::kMsg654, "idm__native_get_groups", sizes, 6, "6", {right}}};
+    sweep::Operation op{
+        [](long) {},
+        [] { return answer(groupstest::get_groups("many")); },
+        right,
+        [] {  // the scan lock is free: another thread's lookup completes
+            auto other = std::async(std::launch::async, [] { return groupstest::get_groups("none").status; });
+            if (other.wait_for(std::chrono::seconds(20)) != std::future_status::ready) {
+                ADD_FAILURE() << "a lookup on another thread does not complete: the scan lock was left held";
+                std::_Exit(1);  // the blocked thread cannot be joined
+            }
+            EXPECT_EQ(other.get(), 0);
+        },
+        [] {},
+    };
+    // User buffer, group buffer, the first element and its name, the scan
+    // buffer, then each of 13 appends grows the array and copies a name.
+    EXPECT_EQ(sweep::run(op, rows), 5 + 2 * 13);
 }
 
 }  // namespace

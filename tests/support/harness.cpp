@@ -1,13 +1,10 @@
 #include "harness.h"
 
 #include <fcntl.h>
-#include <sched.h>
-#include <sys/mount.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
-#include <cerrno>
 #include <cstdio>
 #include <cstring>
 #include <fstream>
@@ -15,22 +12,16 @@
 namespace oxtest {
 
 void write_file(const std::string &path, const std::string &content, int64_t mtime) {
-    std::string tmp = path + ".tmp";
-    {
-        std::ofstream out(tmp, std::ios::binary | std::ios::trunc);
-        out.write(content.data(), static_cast<std::streamsize>(content.size()));
-    }
     // The file gets its time before it takes the path, as a careful writer
     // does: a reader never sees the new version change under it.
+    const std::string tmp = path + ".tmp";
+    std::ofstream(tmp, std::ios::binary | std::ios::trunc) << content;
     if (mtime >= 0) set_mtime(tmp, mtime);
     if (std::rename(tmp.c_str(), path.c_str()) != 0) ADD_FAILURE() << "cannot write " << path;
 }
 
 void set_mtime(const std::string &path, int64_t mtime) {
-    struct timespec times[2];
-    times[0].tv_sec = mtime;
-    times[0].tv_nsec = 0;
-    times[1] = times[0];
+    const struct timespec times[2] = {{mtime, 0}, {mtime, 0}};
     if (utimensat(AT_FDCWD, path.c_str(), times, 0) != 0) ADD_FAILURE() << "utimensat " << path;
 }
 
@@ -44,16 +35,11 @@ Error last_error() {
 
 ::testing::AssertionResult reported(int status, int msgno, const std::vector<std::string> &inserts) {
     if (!cux_error_pending()) return ::testing::AssertionFailure() << "no error reported";
-    Error e = last_error();
-    auto fail = [&]() {
-        auto r = ::testing::AssertionFailure();
-        r << "reported status " << e.status << " message " << e.msgno << " inserts [";
-        for (const auto &s : e.inserts) r << '"' << s << "\" ";
-        r << "]; expected status " << status << " message " << msgno << " inserts [";
-        for (const auto &s : inserts) r << '"' << s << "\" ";
-        return r << "]";
-    };
-    if (e.status != status || e.msgno != msgno || e.inserts != inserts) return fail();
+    const Error e = last_error();
+    if (e.status != status || e.msgno != msgno || e.inserts != inserts)
+        return ::testing::AssertionFailure() << "reported status " << e.status << " message " << e.msgno << " inserts "
+                                             << ::testing::PrintToString(e.inserts) << "; expected " << status
+                                             << " " << msgno << " " << ::testing::PrintToString(inserts);
     if (std::strcmp(cux_error_catalog(), "oxseclib.cat") != 0 || cux_error_set() != 1 || cux_error_reserved() != 0)
         return ::testing::AssertionFailure() << "catalogue/set/reserved arguments wrong";
     return ::testing::AssertionSuccess();
@@ -68,29 +54,23 @@ void clear_errors() {
 
 unsigned long reports_since_clear() { return cux_error_count() - g_error_mark; }
 
-::testing::AssertionResult nothing_reported() {
+static ::testing::AssertionResult nothing_but(int status, int msgno) {
     if (cux_error_count() == g_error_mark) return ::testing::AssertionSuccess();
-    Error e = last_error();
+    const Error e = last_error();
+    if (e.status == status && e.msgno == msgno) return ::testing::AssertionSuccess();
     return ::testing::AssertionFailure() << "unexpected report: status " << e.status << " message " << e.msgno;
 }
+::testing::AssertionResult nothing_reported() { return nothing_but(-1, -1); }
+::testing::AssertionResult nothing_but_list_ends() { return nothing_but(21, 315); }
 
-::testing::AssertionResult nothing_but_list_ends() {
-    if (cux_error_count() == g_error_mark) return ::testing::AssertionSuccess();
-    Error e = last_error();
-    if (e.status == 21 && e.msgno == 315) return ::testing::AssertionSuccess();
-    return ::testing::AssertionFailure() << "unexpected report: status " << e.status << " message " << e.msgno;
-}
-
-int32_t TraceRecord::i32(size_t j) const {
-    int32_t v = 0;
-    if (j < items.size() && items[j].size() == 4) std::memcpy(&v, items[j].data(), 4);
+template <class T>
+static T item(const std::vector<std::string> &items, size_t j) {
+    T v = 0;
+    if (j < items.size() && items[j].size() == sizeof v) std::memcpy(&v, items[j].data(), sizeof v);
     return v;
 }
-uint64_t TraceRecord::u64(size_t j) const {
-    uint64_t v = 0;
-    if (j < items.size() && items[j].size() == 8) std::memcpy(&v, items[j].data(), 8);
-    return v;
-}
+int32_t TraceRecord::i32(size_t j) const { return item<int32_t>(items, j); }
+uint64_t TraceRecord::u64(size_t j) const { return item<uint64_t>(items, j); }
 std::string TraceRecord::text(size_t j) const {
     if (j >= items.size() || items[j].empty() || items[j].back() != '\0') return "<not a text>";
     return items[j].substr(0, items[j].size() - 1);
@@ -98,14 +78,11 @@ std::string TraceRecord::text(size_t j) const {
 
 std::vector<TraceRecord> trace_records() {
     std::vector<TraceRecord> out;
-    size_t n = trx_count();
-    for (size_t i = 0; i < n; ++i) {
-        TraceRecord r{};
-        int items = 0;
-        if (trx_record(i, &r.id, &r.kind, &items) != 0) break;
-        for (int j = 0; j < items; ++j) {
+    int n = 0;
+    for (TraceRecord r{}; trx_record(out.size(), &r.id, &r.kind, &n) == 0; r = {}) {
+        for (int j = 0; j < n; ++j) {
             size_t len = 0;
-            const void *p = trx_item(i, j, &len);
+            const void *p = trx_item(out.size(), j, &len);
             r.items.emplace_back(static_cast<const char *>(p), len);
         }
         out.push_back(std::move(r));
@@ -148,15 +125,14 @@ void Test::TearDown() {
 
 int run_in_child(void (*body)(void *), void *arg) {
     fflush(nullptr);
-    pid_t pid = fork();
+    const pid_t pid = fork();
     if (pid == 0) {
         body(arg);
         _exit(0);
     }
     int status = 0;
     waitpid(pid, &status, 0);
-    if (WIFEXITED(status)) return WEXITSTATUS(status);
-    return 128 + WTERMSIG(status);
+    return WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
 }
 
 }  // namespace oxtest

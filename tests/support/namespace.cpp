@@ -19,29 +19,23 @@ namespace {
 bool g_namespace = false;
 
 bool write_proc(const char *path, const std::string &text) {
-    int fd = open(path, O_WRONLY | O_CLOEXEC);
-    if (fd < 0) return false;
-    bool ok = write(fd, text.data(), text.size()) == static_cast<ssize_t>(text.size());
-    close(fd);
+    const int fd = open(path, O_WRONLY | O_CLOEXEC);
+    const bool ok = fd >= 0 && write(fd, text.data(), text.size()) == static_cast<ssize_t>(text.size());
+    if (fd >= 0) close(fd);
     return ok;
 }
 
 bool mkdirs(const std::string &path) {
-    for (size_t i = 1; i <= path.size(); ++i) {
-        if (i == path.size() || path[i] == '/') {
-            std::string part = path.substr(0, i);
-            if (mkdir(part.c_str(), 0755) != 0 && errno != EEXIST) return false;
-        }
+    for (size_t i = path.find('/', 1);; i = path.find('/', i + 1)) {
+        if (mkdir(path.substr(0, i).c_str(), 0755) != 0 && errno != EEXIST) return false;
+        if (i == std::string::npos) return true;
     }
-    return true;
 }
 
-bool overlay(const char *dir, const char *scratch) {
-    std::string upper = std::string(scratch) + "/upper";
-    std::string work = std::string(scratch) + "/work";
-    if (!mkdirs(upper) || !mkdirs(work)) return false;
-    std::string opts = "lowerdir=" + std::string(dir) + ",upperdir=" + upper + ",workdir=" + work;
-    return mount("overlay", dir, "overlay", 0, opts.c_str()) == 0;
+// `dir` becomes an overlay whose upper layer lies in the private /tmp.
+bool overlay(const char *dir, const std::string &scratch) {
+    const std::string opts = "lowerdir=" + std::string(dir) + ",upperdir=" + scratch + "/upper,workdir=" + scratch + "/work";
+    return mkdirs(scratch + "/upper") && mkdirs(scratch + "/work") && mount("overlay", dir, "overlay", 0, opts.c_str()) == 0;
 }
 
 bool fresh_tmpfs(const char *dir) {
@@ -53,25 +47,23 @@ bool fresh_tmpfs(const char *dir) {
 
 bool enter_private_namespace() {
     if (g_namespace) return true;
-    uid_t uid = geteuid();
-    gid_t gid = getegid();
+    const uid_t uid = geteuid();
+    const gid_t gid = getegid();
     if (uid == 0) {
         if (unshare(CLONE_NEWNS) != 0) return false;
-    } else {
+    } else {  // a user namespace mapping the caller to root
         if (unshare(CLONE_NEWUSER | CLONE_NEWNS) != 0) return false;
         write_proc("/proc/self/setgroups", "deny");
-        if (!write_proc("/proc/self/uid_map", "0 " + std::to_string(uid) + " 1")) return false;
-        if (!write_proc("/proc/self/gid_map", "0 " + std::to_string(gid) + " 1")) return false;
+        if (!write_proc("/proc/self/uid_map", "0 " + std::to_string(uid) + " 1") ||
+            !write_proc("/proc/self/gid_map", "0 " + std::to_string(gid) + " 1"))
+            return false;
     }
-    if (mount(nullptr, "/", nullptr, MS_REC | MS_PRIVATE, nullptr) != 0) return false;
-    // A private /tmp holds the overlays' upper layers; the host's /var and
-    // /opt are never written.
-    if (mount("tmpfs", "/tmp", "tmpfs", 0, "mode=1777") != 0) return false;
-    if (!overlay("/var", "/tmp/.oxtest-var") || !overlay("/opt", "/tmp/.oxtest-opt")) return false;
-    if (!mkdirs(kVarCfg) || !mkdirs(kOptCfg)) return false;
-    if (!fresh_tmpfs(kVarCfg) || !fresh_tmpfs(kOptCfg)) return false;
-    g_namespace = true;
-    return true;
+    // The host's /var and /opt are never written.
+    g_namespace = mount(nullptr, "/", nullptr, MS_REC | MS_PRIVATE, nullptr) == 0 &&
+                  mount("tmpfs", "/tmp", "tmpfs", 0, "mode=1777") == 0 && overlay("/var", "/tmp/.oxtest-var") &&
+                  overlay("/opt", "/tmp/.oxtest-opt") && mkdirs(kVarCfg) && mkdirs(kOptCfg) &&
+                  fresh_tmpfs(kVarCfg) && fresh_tmpfs(kOptCfg);
+    return g_namespace;
 }
 
 bool in_private_namespace() { return g_namespace; }

@@ -8,6 +8,7 @@
 
 #include <cstdlib>
 #include <cstring>
+#include <new>
 #include <string>
 
 #include "oxidm.h"
@@ -16,20 +17,15 @@ namespace oxtest {
 
 // A prefix and a number as one text (appended: GCC 12 -O3 misreads
 // literal + string).
-inline std::string num(const char *prefix, long n) {
-    std::string s(prefix);
-    s += std::to_string(n);
-    return s;
-}
+inline std::string num(const char *prefix, long n) { return std::string(prefix).append(std::to_string(n)); }
 
-// Descriptors open in this process now.
+// Descriptors open in this process now (not the one listing them).
 inline int open_descriptors() {
-    int n = 0;
+    int n = -1;
     DIR *d = opendir("/proc/self/fd");
-    while (dirent *e = readdir(d))
-        if (e->d_name[0] != '.') ++n;
+    while (dirent *e = readdir(d)) n += e->d_name[0] != '.';
     closedir(d);
-    return n - 1;  // not the one listing the directory
+    return n;
 }
 
 inline char *heap_copy(const char *s, size_t n) {
@@ -40,39 +36,31 @@ inline char *heap_copy(const char *s, size_t n) {
 }
 inline char *heap_copy(const char *s) { return heap_copy(s, std::strlen(s)); }
 
-inline char **one_token(const char *s) {
-    auto **t = static_cast<char **>(std::malloc(sizeof(char *)));
-    t[0] = heap_copy(s);
-    return t;
-}
+inline char **one_token(const char *s) { return new (std::malloc(sizeof(char *))) char *(heap_copy(s)); }
 
 // A mapping buffer holding `local` with its NUL, as translators fill it.
 inline idm_buffer *mapping_of(const char *local) {
-    auto *b = static_cast<idm_buffer *>(std::malloc(sizeof(idm_buffer)));
-    b->value = heap_copy(local);
-    b->length = static_cast<uint32_t>(std::strlen(local) + 1);
-    return b;
+    return new (std::malloc(sizeof(idm_buffer))) idm_buffer{static_cast<uint32_t>(std::strlen(local) + 1), heap_copy(local)};
 }
 
-// Frees what a test translator put in a rule or an id (one token at most)
-// and clears the record.
+// Free what a test translator put in a rule or an id (one token at most)
+// and clear the record.
+template <class T>
+inline void free_texts(T *r) {
+    std::free(r->rgy_type);
+    std::free(r->rgy);
+    if (r->tokens != nullptr) std::free(r->tokens[0]);
+    std::free(r->tokens);
+    *r = T{};
+}
 inline void free_rule(idm_rule *rule) {
     if (rule == nullptr) return;
-    std::free(rule->rgy_type);
-    std::free(rule->rgy);
-    if (rule->tokens != nullptr) std::free(rule->tokens[0]);
-    std::free(rule->tokens);
     if (rule->mapping != nullptr) std::free(rule->mapping->value);
     std::free(rule->mapping);
-    *rule = idm_rule{};
+    free_texts(rule);
 }
 inline void free_id(idm_id *id) {
-    if (id == nullptr) return;
-    std::free(id->rgy_type);
-    std::free(id->rgy);
-    if (id->tokens != nullptr) std::free(id->tokens[0]);
-    std::free(id->tokens);
-    *id = idm_id{};
+    if (id != nullptr) free_texts(id);
 }
 inline int32_t free_rule_and_id(idm_rule *rule, idm_id *id) {
     free_rule(rule);

@@ -1,23 +1,23 @@
 // Allocation-failure sweeps: the 1st, 2nd, ... allocation of a whole
-// operation fails in turn, until the operation completes without reaching
-// a failure.  Each step must report the failure row of the site that
-// failed (message, status, inserts), leak nothing, leave no lock held and
-// no descriptor open, and the calls after it must give the right answer.
-//
-// The failure rows of an operation are listed once; a step's report picks
-// its row by message and inserts, and every row must be hit by some step,
-// so a site that stops failing (or starts failing elsewhere) is noticed.
+// operation fails in turn, until the operation completes without reaching a
+// failure.  Each step must make exactly one 2650-654/658/691 report, of a
+// site listed in the operation's table (message, function, size, status),
+// answer what that row says now and at the next call, leak nothing, leave
+// no lock held and free every block that held an identity or a path zeroed.
+// Every row must be hit by some step, so a site that stops failing, or
+// starts failing elsewhere, is noticed.
 #ifndef OXIDM_TEST_SWEEP_H
 #define OXIDM_TEST_SWEEP_H
 
-#include <dirent.h>
-
+#include <algorithm>
+#include <atomic>
 #include <functional>
 #include <set>
 #include <string>
 #include <vector>
 
 #include "harness.h"
+#include "oxseclib_msg.h"
 #include "test_mpm.h"
 
 #if defined(__SANITIZE_ADDRESS__)
@@ -27,7 +27,7 @@
 namespace sweep {
 
 // True when the leak checker finds no unreachable block now (always true
-// without the address sanitizer; the process exit check still runs).
+// without the address sanitizer; the exit check still runs).
 inline bool no_leaks() {
 #if defined(__SANITIZE_ADDRESS__)
     return __lsan_do_recoverable_leak_check() == 0;
@@ -36,58 +36,108 @@ inline bool no_leaks() {
 #endif
 }
 
+inline std::atomic<int> g_unzeroed{0};
+inline void check_zeroed(const void *p, size_t n) {
+    const auto *b = static_cast<const unsigned char *>(p);
+    if (std::any_of(b, b + n, [](unsigned char c) { return c != 0; })) g_unzeroed.fetch_add(1);
+}
+
 inline bool unlocked(pthread_mutex_t *m) {
     if (pthread_mutex_trylock(m) != 0) return false;
     pthread_mutex_unlock(m);
     return true;
 }
 
-// One failure site: the report it makes and what the operation does then.
+// Reports made during a step.  A later report replaces the current error,
+// so an operation that goes on after a failure (a mapping walk) calls note()
+// from its callbacks as well.
+inline std::vector<oxtest::Error> g_notes;
+inline unsigned long g_seen = 0;
+inline void note() {
+    if (cux_error_count() == g_seen) return;
+    g_seen = cux_error_count();
+    g_notes.push_back(oxtest::last_error());
+}
+
+// One failure site: its report, and the answers of the failed call and of
+// the next one (nothing changed in between; any of `next`).
 struct Row {
     const char *label;
     int msgno;
-    std::string function;        // first insert
-    std::set<std::string> sizes;  // second insert: the bytes of any allocation of this site
-    int recorded;                // status given to cu_set_error_1
-    int returned;                // status of the whole operation
-    int outcome;                 // meaning defined by the sweep
+    const char *function;         // first insert ("" for a report without inserts)
+    std::set<std::string> sizes;  // second insert: any allocation of this site
+    int recorded;                 // status given with the report
+    std::string now;
+    std::set<std::string> next;
     int hits = 0;
 };
 
-// The row whose message, function and size match `e` (a row without a
-// function: a message without inserts), or nullptr.
-inline Row *row_of(std::vector<Row> &rows, const oxtest::Error &e) {
-    for (Row &r : rows) {
-        if (r.msgno != e.msgno) continue;
-        if (r.function.empty() ? e.inserts.empty()
-                               : e.inserts.size() == 2 && e.inserts[0] == r.function && r.sizes.count(e.inserts[1]))
-            return &r;
-    }
-    return nullptr;
-}
+struct Operation {
+    std::function<void(long n)> prepare;  // state before step n
+    std::function<std::string()> call;    // the operation; its answer as a text
+    std::string right;                    // the answer without a failure
+    std::function<void()> settled;        // checks: no lock held, nothing left open
+    std::function<void()> after;          // after a failure: checks that everything comes back
+};
 
-inline std::string describe(const oxtest::Error &e) {
-    std::string s = "status " + std::to_string(e.status) + " message " + std::to_string(e.msgno) + " [";
-    for (const std::string &i : e.inserts) s += "\"" + i + "\" ";
-    return s + "]";
-}
-
-// Runs step(n) for n = 1, 2, ... with the n-th allocation from the start of
-// the operation failing; step returns whether the failure fired.  Returns
-// the number of allocations the operation makes (the steps that fired).
-inline int run(const std::function<bool(long)> &step, long limit = 400) {
+// Runs the sweep; returns the number of allocations the operation makes.
+inline long run(const Operation &op, std::vector<Row> &rows, long limit = 400) {
+    idm_test_on_secret_free(check_zeroed);
+    struct Off {
+        ~Off() {
+            idm_test_fail_alloc(0);
+            idm_test_on_secret_free(nullptr);
+            EXPECT_EQ(g_unzeroed.exchange(0), 0) << "a block that held an identity or a path was freed unzeroed";
+        }
+    } off;
     for (long n = 1; n <= limit; ++n) {
         SCOPED_TRACE("failing allocation " + std::to_string(n));
-        if (!step(n)) return static_cast<int>(n - 1);
-        if (::testing::Test::HasFatalFailure()) return -1;
+        op.prepare(n);
+        oxtest::clear_errors();
+        g_notes.clear();
+        g_seen = cux_error_count();
+        idm_test_fail_alloc(n);
+        const std::string got = op.call();
+        const bool fired = idm_test_alloc_fired() != 0;
+        idm_test_fail_alloc(0);
+        note();
+        op.settled();
+        std::vector<oxtest::Error> failures;
+        for (const oxtest::Error &e : g_notes)
+            if (e.msgno == idm::kMsg654 || e.msgno == idm::kMsg658 || e.msgno == idm::kMsg691) failures.push_back(e);
+        if (!fired) {
+            EXPECT_EQ(got, op.right);
+            EXPECT_TRUE(failures.empty());
+            EXPECT_TRUE(no_leaks());
+            for (const Row &r : rows) EXPECT_GT(r.hits, 0) << "no step failed at: " << r.label;
+            return n - 1;
+        }
+        EXPECT_EQ(failures.size(), 1u) << "one report per failure";
+        if (failures.empty()) continue;
+        const oxtest::Error &e = failures.front();
+        Row *row = nullptr;
+        for (Row &r : rows)
+            if (r.msgno == e.msgno && (*r.function == '\0' ? e.inserts.empty()
+                                                             : e.inserts.size() == 2 && e.inserts[0] == r.function &&
+                                                                   r.sizes.count(e.inserts[1])))
+                row = &r;
+        if (row == nullptr) {
+            ADD_FAILURE() << "no row for message " << e.msgno << " status " << e.status << " inserts "
+                          << ::testing::PrintToString(e.inserts);
+            continue;
+        }
+        SCOPED_TRACE(row->label);
+        ++row->hits;
+        EXPECT_EQ(e.status, row->recorded);
+        EXPECT_EQ(got, row->now);
+        const std::string next = op.call();
+        EXPECT_TRUE(row->next.count(next)) << "next call answered " << next;
+        op.after();
+        op.settled();
+        EXPECT_TRUE(no_leaks());
     }
     ADD_FAILURE() << "the operation never completed within " << limit << " allocations";
     return -1;
-}
-
-// Every row was reached by at least one step.
-inline void expect_all_hit(const std::vector<Row> &rows) {
-    for (const Row &r : rows) EXPECT_GT(r.hits, 0) << "no step failed at: " << r.label;
 }
 
 }  // namespace sweep
