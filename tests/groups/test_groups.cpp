@@ -13,7 +13,7 @@
 
 #include "../unit/test_sweep.h"
 #include "groups_db.h"
-#include "oxidm_internal.h"
+#include "oxidm_state.h"
 
 namespace {
 
@@ -122,7 +122,7 @@ TEST_F(Groups, LastFailureGivesTheStatus) {
     EXPECT_EQ(groupstest::get_groups("alice").status, 15);
     idm_test_fail_alloc(0);
     EXPECT_EQ(oxtest::reports_since_clear(), 2u);
-    EXPECT_TRUE(oxtest::reported(15, idm::kMsg700, {std::to_string(EIO)}));
+    EXPECT_TRUE(oxtest::reported(idm::kGroupsUnavailable, idm::kMsg700, {std::to_string(EIO)}));
     EXPECT_EQ(groupstest::getgrent_calls(), 9) << "the scan went on after the append failure";
 }
 
