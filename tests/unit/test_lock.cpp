@@ -1,6 +1,7 @@
-// Reader-writer lock, single-threaded state transitions: try-lock,
-// promotion of the only reader, demotion, destroy.  The scenarios with
-// waiting threads and cancellation are in concurrency/test_cluster_lock.cpp.
+// Reader-writer lock on one thread: the counters through every operation
+// that does not wait, with the mutex free after each; the withdrawal of a
+// waiting writer; destroy.  Waiting and cancelled threads are the
+// concurrency suite's.
 #include <cstring>
 
 #include "harness.h"
@@ -13,83 +14,54 @@ class LockState : public oxtest::Test {
   protected:
     void SetUp() override {
         oxtest::Test::SetUp();
-        std::memset(static_cast<void *>(&lock), 0xA5, sizeof lock);
+        std::memset(static_cast<void *>(&lock), 0xA5, sizeof lock);  // init sets every field
         sec__lock_init(&lock);
     }
-    void TearDown() override {
-        idm_test_fail_mutex_init(0);
-        oxtest::Test::TearDown();
-    }
+    bool mutex_free() { return pthread_mutex_trylock(&lock.mutex) == 0 && pthread_mutex_unlock(&lock.mutex) == 0; }
     sec_rwlock lock;
 };
 
-TEST_F(LockState, InitZeroesTheCounters) {
-    EXPECT_EQ(lock.lock_count, 0);
-    EXPECT_EQ(lock.waiting_writers, 0u);
-    EXPECT_EQ(pthread_mutex_trylock(&lock.mutex), 0);
-    pthread_mutex_unlock(&lock.mutex);
-}
+int rd(sec_rwlock *l) { return sec__lock_read(l), 0; }
+int unrd(sec_rwlock *l) { return sec__unlock_read(l), 0; }
+int wr(sec_rwlock *l) { return sec__lock_write(l), 0; }
+int unwr(sec_rwlock *l) { return sec__unlock_write(l), 0; }
+int promote(sec_rwlock *l) { return sec__lock_promote(l), 0; }
+int demote(sec_rwlock *l) { return sec__lock_demote(l), 0; }
 
-TEST_F(LockState, TryLockAnswersFromTheCountOnly) {
-    struct Case {
-        const char *label;
-        int32_t lock_count;
-        uint32_t waiting_writers;
-        int answer;
-        int32_t after;
-    } cases[] = {
-        {"free", 0, 0, 0, -1},
-        {"held by one reader", 1, 0, -1, 1},
-        {"held by a writer", -1, 0, -1, -1},
-        {"free while writers wait", 0, 2, 0, -1},
+TEST_F(LockState, CountersThroughEveryOperationThenDestroy) {
+    const struct {
+        int (*op)(sec_rwlock *);
+        uint32_t waiting;  // waiting writers, set before the operation
+        int result;        // of trylock
+        int32_t count;     // after
+    } steps[] = {
+        {rd, 0, 0, 1},   {rd, 0, 0, 2},      {sec__trylock_write, 0, -1, 2}, {unrd, 0, 0, 1},
+        {promote, 0, 0, -1},                 {sec__trylock_write, 0, -1, -1}, {demote, 0, 0, 1},
+        {unrd, 0, 0, 0}, {wr, 0, 0, -1},     {unwr, 0, 0, 0},
+        {sec__trylock_write, 2, 0, -1} /* waiting writers are not considered */, {unwr, 2, 0, 0},
     };
-    for (const Case &c : cases) {
-        SCOPED_TRACE(c.label);
-        lock.lock_count = c.lock_count;
-        lock.waiting_writers = c.waiting_writers;
-        EXPECT_EQ(sec__trylock_write(&lock), c.answer);
-        EXPECT_EQ(lock.lock_count, c.after);
-        EXPECT_EQ(lock.waiting_writers, c.waiting_writers);
+    EXPECT_TRUE(lock.lock_count == 0 && lock.waiting_writers == 0 && mutex_free());
+    for (const auto &s : steps) {
+        SCOPED_TRACE(&s - steps);
+        lock.waiting_writers = s.waiting;
+        EXPECT_EQ(s.op(&lock), s.result);
+        EXPECT_EQ(lock.lock_count, s.count);
+        EXPECT_EQ(lock.waiting_writers, s.waiting);
+        EXPECT_TRUE(mutex_free());
     }
-}
-
-TEST_F(LockState, TheOnlyReaderPromotesAndDemotesWithoutWaiting) {
-    sec__lock_read(&lock);
-    EXPECT_EQ(lock.lock_count, 1);
-    sec__lock_promote(&lock);
-    EXPECT_EQ(lock.lock_count, -1);
-    EXPECT_EQ(lock.waiting_writers, 0u);
-    sec__lock_demote(&lock);
-    EXPECT_EQ(lock.lock_count, 1);
-    sec__unlock_read(&lock);
-    EXPECT_EQ(lock.lock_count, 0);
-    sec__lock_write(&lock);
-    EXPECT_EQ(lock.lock_count, -1);
-    sec__unlock_write(&lock);
-    EXPECT_EQ(lock.lock_count, 0);
-}
-
-TEST_F(LockState, DestroyLeavesZeroBytesAndTheRecordCanBeInitialisedAgain) {
-    sec__lock_read(&lock);
-    sec__unlock_read(&lock);
+    // A waiting writer that gives up withdraws and releases the mutex.
+    for (uint32_t waiting : {2u, 1u}) {
+        pthread_mutex_lock(&lock.mutex);
+        lock.waiting_writers = waiting;
+        sec__waiting_writer_cleanup(&lock);
+        EXPECT_EQ(lock.waiting_writers, waiting - 1);
+        EXPECT_TRUE(mutex_free());
+    }
+    EXPECT_EQ(pthread_mutex_destroy(&lock.mutex), 0) << "every operation locked the mutex as often as it unlocked it";
+    pthread_mutex_init(&lock.mutex, nullptr);
     EXPECT_EQ(sec__lock_destroy(&lock), 0);
     const sec_rwlock zero{};
     EXPECT_EQ(std::memcmp(&lock, &zero, sizeof lock), 0);
-    sec__lock_init(&lock);
-    sec__lock_write(&lock);
-    EXPECT_EQ(lock.lock_count, -1);
-    sec__unlock_write(&lock);
-    sec__lock_destroy(&lock);
-}
-
-TEST_F(LockState, SimpleInitPassesTheResultThrough) {
-    pthread_mutex_t m;
-    EXPECT_EQ(sec__simple_init(&m), 0);
-    EXPECT_EQ(pthread_mutex_trylock(&m), 0);
-    pthread_mutex_unlock(&m);
-    pthread_mutex_destroy(&m);
-    idm_test_fail_mutex_init(EAGAIN);
-    EXPECT_EQ(sec__simple_init(&m), EAGAIN);
 }
 
 }  // namespace
