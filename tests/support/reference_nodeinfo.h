@@ -19,7 +19,7 @@
 #include <vector>
 
 #include "oxidm_clmap.h"
-#include "oxidm_internal.h"
+#include "oxidm_state.h"
 
 namespace refnode {
 
