@@ -51,14 +51,13 @@ inline Text *intern(const std::string &s) {
     return &it->second;
 }
 
-inline char g_type[] = "t";
 template <char Pair = 0>
 int32_t translate(const idm_mapfile_entry *entry, const char *network_id, idm_rule *rule, idm_id *id) {
     point(kTranslator);
     if (entry != nullptr) {
         const char *dot = std::strchr(entry->network_id, '.');
         if (dot == nullptr) return 5;  // not ours: passed over
-        rule->rgy_type = g_type;
+        rule->rgy_type = const_cast<char *>("t");  // never written
         rule->rgy = intern(std::string(entry->network_id, size_t(dot - entry->network_id)))->p[0];
         rule->token_cnt = 1;
         rule->tokens = intern(dot + 1)->p;
@@ -67,7 +66,7 @@ int32_t translate(const idm_mapfile_entry *entry, const char *network_id, idm_ru
     }
     (rule->rgy[0] == 'G' ? walk.global : walk.local).saw(std::atol(rule->rgy + 1));
     walk.pair.saw(Pair);
-    id->rgy_type = g_type;
+    id->rgy_type = rule->rgy_type;
     id->rgy = rule->rgy;
     id->token_cnt = 1;
     id->tokens = intern(network_id)->p;

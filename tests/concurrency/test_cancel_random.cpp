@@ -93,8 +93,7 @@ TEST_F(CancelRandom, ThreadsCancelledAnywhereLeaveNothingBehind) {
     EXPECT_EQ(wrong.load(), 0);
     EXPECT_GT(in_mpm, 3) << "no cancellation landed inside the MPM by chance";
     EXPECT_GT(in_lock_wait, 0) << "no cancellation landed in a wait for idmutex";
-    EXPECT_TRUE(threads::unlocked(&idm__native_find_translator("s0")->mutex));
-    EXPECT_TRUE(threads::unlocked(&idm__native_state.mutex));
+    EXPECT_TRUE(threads::unlocked(&idm__native_find_translator("s0")->mutex) && threads::unlocked(&idm__native_state.mutex));
     EXPECT_EQ(mssx_locks_held(), 0);
     EXPECT_EQ(threads::counts(idmutex), (threads::Counts{0, 0}));
     EXPECT_EQ(open_descriptors(), descriptors);

@@ -153,7 +153,9 @@ TEST_F(Races, AQueryWaitsForTheLoadThatClaimedItsTime) {
     threads::Thread writer([&] { sec__lock_write(&idmutex), threads::eventually([&] { return release.load(); }), sec__unlock_write(&idmutex); });
     ASSERT_TRUE(threads::eventually([&] { return threads::waits_on(writer.tid(), idmutex) == 'W'; }));
     g_hold = false;
-    ASSERT_TRUE(threads::eventually([&] { return threads::waits_on(loader.tid(), idmutex) == 'R'; }));
+    ASSERT_TRUE(threads::eventually([&] {  // the writer holds the lock; the load waits to demote
+        return threads::counts(idmutex) == threads::Counts{-1, 0} && threads::waits_on(loader.tid(), idmutex) == 'R';
+    }));
     EXPECT_TRUE(loader.cancel());
     EXPECT_EQ(threads::counts(idmutex), (threads::Counts{-1, 0})) << "only the writer holds the lock";
     release = true;
