@@ -1,340 +1,107 @@
-// Reader-writer lock with real threads: writer preference, the wake-up
-// rules, promotion and demotion, and cancellation of every kind of waiter.
-// A thread's waiting is established by the condition variable it sleeps on
-// (test_cluster_threads.h), never by sleeping and hoping.
-#include <atomic>
-#include <mutex>
+// The reader-writer lock with real threads: writer preference, whom a release
+// wakes, promotion and demotion, and cancellation of every kind of waiter.
+// Each wait is established by the condition variable the thread sleeps on.
+#include <memory>
+#include <sstream>
 #include <vector>
 
 #include "harness.h"
-#include "oxsec_lock.h"
-#include "test_cluster_threads.h"
+#include "threads.h"
 
 namespace {
 
-using cluster_test::blocked_on;
-using cluster_test::eventually;
-using cluster_test::Thread;
+using threads::eventually;
 
-struct Counts {
-    int32_t lock_count;
-    uint32_t waiting_writers;
-    bool operator==(const Counts &o) const { return lock_count == o.lock_count && waiting_writers == o.waiting_writers; }
-};
-std::ostream &operator<<(std::ostream &os, const Counts &c) {
-    return os << "{lock_count " << c.lock_count << ", waiting_writers " << c.waiting_writers << "}";
+void run(sec_rwlock *lock, char op) {
+    void (*const ops[])(sec_rwlock *) = {sec__lock_read,   sec__lock_write,  sec__lock_promote,
+                                         sec__lock_demote, sec__unlock_read, sec__unlock_write};
+    ops[std::string("rwpduU").find(op)](lock);
 }
 
-// Order in which the threads of a scenario obtained their holds.
-class Events {
-  public:
-    void add(const std::string &e) {
-        std::lock_guard<std::mutex> g(m_);
-        events_.push_back(e);
-    }
-    std::vector<std::string> get() {
-        std::lock_guard<std::mutex> g(m_);
-        return events_;
-    }
-
-  private:
-    std::mutex m_;
-    std::vector<std::string> events_;
+// A thread obeying one order at a time: r/w lock, p promote, d demote, u/U
+// unlock read/write, x leave.  held() is what it holds once its order is done.
+struct Actor {
+    std::atomic<char> order_{0}, held_{0};
+    std::atomic<bool> busy_{false};
+    explicit Actor(sec_rwlock *lock)
+        : thread_([this, lock] {
+              for (char c;; busy_ = false) {
+                  while ((c = order_.exchange(0)) == 0) usleep(100);
+                  if (c == 'x') return;
+                  run(lock, c);
+                  held_ = c == 'w' || c == 'p' ? 'w' : c == 'r' || c == 'd' ? 'r' : 0;
+              }
+          }) {}
+    ~Actor() { busy_ ? (void)thread_.cancel() : order('x'); }  // still waiting: a failed scenario
+    void order(char c) { busy_ = true, order_ = c; }
+    bool busy() const { return busy_; }
+    char held() const { return busy_ ? 0 : held_.load(); }
+    threads::Thread thread_;  // last: started once the rest is set up
 };
 
-class Lock : public oxtest::Test {
-  protected:
-    void SetUp() override {
-        oxtest::Test::SetUp();
-        if (!cluster_test::can_see_blocked_threads()) GTEST_SKIP() << "/proc/<pid>/syscall not readable";
+// Steps: "M<op>" the test thread runs r, w, u or U; "A<op><then>" actor A
+// (to D) is ordered op and then has it ('>') or sleeps on readers_ok ('R')
+// or writer_ok ('W'); "A>" A's order completes; "A." A still waits; "Ac" A
+// is cancelled while it waits; "*U" the actor holding the write hold
+// releases it; "=h,w" the counters become lock_count h, waiting_writers w.
+const char *const kScenarios[][2] = {
+    {"a waiting writer holds back new readers and goes first",
+     "Mr Mr AwW BrR =2,1 Mu =1,1 A. Mu A> =-1,0 B. AU B> =1,0 Bu =0,0"},
+    {"a cancelled waiting writer releases the readers it held back", "Mr Mr AwW BrR Ac B> =3,0 Mu Mu Bu =0,0"},
+    {"a cancelled waiting reader leaves the counters alone", "Mw ArR Ac =-1,0 Mt- MU =0,0 Mt+ =-1,0 MU Mr Mt- Mu"},
+    {"a leaving writer wakes every reader when no writer waits", "Mw ArR BrR CrR MU A> B> C> =3,0 Au Bu Cu =0,0"},
+    {"a leaving writer passes the lock to one waiting writer",
+     "Mw AwW BwW CrR MU =-1,1 C. *U =-1,0 C. *U C> =1,0 Cu =0,0"},
+    {"two readers promote one after the other", "Ar> Br> ApW =1,1 Bp> =-1,1 A. BU A> =-1,0 AU =0,0"},
+    {"a cancelled promoter holds nothing and releases the readers", "Mr Ar> ApW BrR =1,1 Ac B> =2,0 Mu Bu =0,0"},
+    {"a demoting writer waits behind both waiting writers",
+     "Aw> BwW CwW AdR =-1,1 A. *U =-1,0 A. *U A> =1,0 Au =0,0"},
+    {"a cancelled demoter holds nothing", "Aw> BwW AdR =-1,0 Ac =-1,0 BU =0,0"},
+};
+
+TEST(Lock, Scenarios) {
+    if (!threads::can_see_blocked_threads()) GTEST_SKIP() << "/proc/<pid>/syscall not readable";
+    for (const auto &s : kScenarios) {
+        SCOPED_TRACE(s[0]);
+        sec_rwlock lock;
         sec__lock_init(&lock);
-    }
-    void TearDown() override {
-        sec__lock_destroy(&lock);
-        oxtest::Test::TearDown();
-    }
-    // Reads the counters under the lock's mutex; also proves that no thread
-    // left the mutex locked.
-    Counts counts() {
-        pthread_mutex_lock(&lock.mutex);
-        Counts c{lock.lock_count, lock.waiting_writers};
-        pthread_mutex_unlock(&lock.mutex);
-        return c;
-    }
-    sec_rwlock lock{};
-    Events events;
-};
-
-TEST_F(Lock, AWaitingWriterHoldsBackNewReadersAndGoesFirst) {
-    sec__lock_read(&lock);
-    sec__lock_read(&lock);
-    std::atomic<bool> release_writer{false}, writer_in{false}, reader_in{false};
-    Thread writer([&] {
-        sec__lock_write(&lock);
-        writer_in = true;
-        events.add("writer");
-        while (!release_writer) std::this_thread::yield();
-        sec__unlock_write(&lock);
-    });
-    ASSERT_TRUE(blocked_on(writer.tid(), lock.writer_ok));
-    Thread reader([&] {
-        sec__lock_read(&lock);
-        reader_in = true;
-        events.add("reader");
-        sec__unlock_read(&lock);
-    });
-    ASSERT_TRUE(blocked_on(reader.tid(), lock.readers_ok)) << "a new reader waits behind a waiting writer";
-    EXPECT_EQ(counts(), (Counts{2, 1}));
-    sec__unlock_read(&lock);
-    EXPECT_EQ(counts(), (Counts{1, 1}));
-    EXPECT_FALSE(writer_in.load());
-    sec__unlock_read(&lock);
-    ASSERT_TRUE(eventually(writer_in)) << "the last reader leaving wakes the writer";
-    EXPECT_EQ(counts(), (Counts{-1, 0}));
-    EXPECT_TRUE(blocked_on(reader.tid(), lock.readers_ok));
-    release_writer = true;
-    ASSERT_TRUE(eventually(reader_in));
-    reader.join();
-    writer.join();
-    EXPECT_EQ(events.get(), (std::vector<std::string>{"writer", "reader"}));
-    EXPECT_EQ(counts(), (Counts{0, 0}));
-}
-
-TEST_F(Lock, ACancelledWaitingWriterReleasesTheReadersItHeldBack) {
-    sec__lock_read(&lock);
-    sec__lock_read(&lock);
-    std::atomic<bool> writer_in{false}, reader_in{false};
-    Thread writer([&] {
-        sec__lock_write(&lock);
-        writer_in = true;
-    });
-    ASSERT_TRUE(blocked_on(writer.tid(), lock.writer_ok));
-    Thread reader([&] {
-        sec__lock_read(&lock);
-        reader_in = true;
-    });
-    ASSERT_TRUE(blocked_on(reader.tid(), lock.readers_ok));
-    writer.cancel();
-    EXPECT_TRUE(writer.join()) << "the writer ended by cancellation";
-    EXPECT_FALSE(writer_in.load());
-    ASSERT_TRUE(eventually(reader_in)) << "the reader goes at once, with both read holds still in place";
-    reader.join();
-    EXPECT_EQ(counts(), (Counts{3, 0}));
-    for (int i = 0; i < 3; ++i) sec__unlock_read(&lock);
-    EXPECT_EQ(sec__trylock_write(&lock), 0);
-}
-
-TEST_F(Lock, ACancelledWaitingReaderLeavesTheCountersAlone) {
-    sec__lock_write(&lock);
-    Thread reader([&] { sec__lock_read(&lock); });
-    ASSERT_TRUE(blocked_on(reader.tid(), lock.readers_ok));
-    reader.cancel();
-    EXPECT_TRUE(reader.join());
-    EXPECT_EQ(counts(), (Counts{-1, 0}));
-    sec__unlock_write(&lock);
-    EXPECT_EQ(counts(), (Counts{0, 0}));
-}
-
-TEST_F(Lock, WriterLeavingWithoutWaitingWritersWakesEveryReader) {
-    sec__lock_write(&lock);
-    std::atomic<int> inside{0};
-    std::vector<std::unique_ptr<Thread>> readers;
-    for (int i = 0; i < 3; ++i)
-        readers.push_back(std::make_unique<Thread>([&] {
-            sec__lock_read(&lock);
-            inside++;
-        }));
-    for (auto &r : readers) ASSERT_TRUE(blocked_on(r->tid(), lock.readers_ok));
-    sec__unlock_write(&lock);
-    for (auto &r : readers) r->join();
-    EXPECT_EQ(inside.load(), 3);
-    EXPECT_EQ(counts(), (Counts{3, 0}));
-}
-
-TEST_F(Lock, WriterLeavingWithWaitingWritersPassesTheLockToOneWriter) {
-    sec__lock_write(&lock);
-    std::atomic<int> writers_in{0};
-    std::atomic<bool> release{false}, reader_in{false};
-    auto writer_body = [&] {
-        sec__lock_write(&lock);
-        writers_in++;
-        while (!release) std::this_thread::yield();
-        sec__unlock_write(&lock);
-    };
-    Thread w1(writer_body), w2(writer_body);
-    ASSERT_TRUE(blocked_on(w1.tid(), lock.writer_ok));
-    ASSERT_TRUE(blocked_on(w2.tid(), lock.writer_ok));
-    Thread reader([&] {
-        sec__lock_read(&lock);
-        reader_in = true;
-        sec__unlock_read(&lock);
-    });
-    ASSERT_TRUE(blocked_on(reader.tid(), lock.readers_ok));
-    sec__unlock_write(&lock);
-    for (int i = 0; i < 300000 && writers_in.load() == 0; ++i) usleep(100);
-    EXPECT_EQ(writers_in.load(), 1);
-    EXPECT_EQ(counts(), (Counts{-1, 1}));
-    EXPECT_FALSE(reader_in.load());
-    release = true;
-    w1.join();
-    w2.join();
-    reader.join();
-    EXPECT_EQ(writers_in.load(), 2);
-    EXPECT_TRUE(reader_in.load());
-    EXPECT_EQ(counts(), (Counts{0, 0}));
-}
-
-TEST_F(Lock, TwoReadersPromoteOneAfterTheOther) {
-    std::atomic<bool> a_reads{false}, b_reads{false}, b_promote{false}, b_release{false};
-    Thread a([&] {
-        sec__lock_read(&lock);
-        a_reads = true;
-        while (!b_reads) std::this_thread::yield();
-        sec__lock_promote(&lock);
-        events.add("a write");
-        sec__unlock_write(&lock);
-    });
-    Thread b([&] {
-        sec__lock_read(&lock);
-        b_reads = true;
-        while (!b_promote) std::this_thread::yield();
-        sec__lock_promote(&lock);
-        events.add("b write");
-        while (!b_release) std::this_thread::yield();
-        sec__unlock_write(&lock);
-    });
-    ASSERT_TRUE(blocked_on(a.tid(), lock.writer_ok)) << "the first promoter waits for the other reader";
-    EXPECT_EQ(counts(), (Counts{1, 1}));
-    b_promote = true;
-    for (int i = 0; i < 300000 && events.get().empty(); ++i) usleep(100);
-    EXPECT_EQ(events.get(), std::vector<std::string>{"b write"}) << "giving up the last read hold gets it at once";
-    EXPECT_EQ(counts(), (Counts{-1, 1}));
-    b_release = true;
-    a.join();
-    b.join();
-    EXPECT_EQ(events.get(), (std::vector<std::string>{"b write", "a write"}));
-    EXPECT_EQ(counts(), (Counts{0, 0}));
-}
-
-TEST_F(Lock, ACancelledPromoterHoldsNothingAndReleasesWaitingReaders) {
-    sec__lock_read(&lock);
-    std::atomic<bool> reader_in{false};
-    Thread promoter([&] {
-        sec__lock_read(&lock);
-        sec__lock_promote(&lock);
-        ADD_FAILURE() << "promotion cannot succeed while the main thread reads";
-    });
-    ASSERT_TRUE(blocked_on(promoter.tid(), lock.writer_ok));
-    Thread reader([&] {
-        sec__lock_read(&lock);
-        reader_in = true;
-    });
-    ASSERT_TRUE(blocked_on(reader.tid(), lock.readers_ok));
-    promoter.cancel();
-    EXPECT_TRUE(promoter.join());
-    ASSERT_TRUE(eventually(reader_in));
-    reader.join();
-    EXPECT_EQ(counts(), (Counts{2, 0})) << "main's and the new reader's holds; the promoter's is gone";
-}
-
-TEST_F(Lock, ADemotingWriterWaitsBehindBothWaitingWriters) {
-    sec__lock_write(&lock);
-    auto writer_body = [&](const char *name) {
-        return [this, name] {
-            sec__lock_write(&lock);
-            events.add(name);
-            sec__unlock_write(&lock);
-        };
-    };
-    Thread w1(writer_body("w1")), w2(writer_body("w2"));
-    ASSERT_TRUE(blocked_on(w1.tid(), lock.writer_ok));
-    ASSERT_TRUE(blocked_on(w2.tid(), lock.writer_ok));
-    Thread demoter([&] {
-        // Takes over the main thread's write hold (the lock keeps no owner).
-        sec__lock_demote(&lock);
-        events.add("demoter read");
-    });
-    demoter.join();
-    w1.join();
-    w2.join();
-    auto e = events.get();
-    ASSERT_EQ(e.size(), 3u);
-    EXPECT_EQ(e[2], "demoter read");
-    EXPECT_EQ(counts(), (Counts{1, 0}));
-}
-
-TEST_F(Lock, ACancelledDemoterHoldsNothing) {
-    sec__lock_write(&lock);
-    std::atomic<bool> writer_in{false}, release{false};
-    Thread writer([&] {
-        sec__lock_write(&lock);
-        writer_in = true;
-        while (!release) std::this_thread::yield();
-        sec__unlock_write(&lock);
-    });
-    ASSERT_TRUE(blocked_on(writer.tid(), lock.writer_ok));
-    Thread demoter([&] {
-        sec__lock_demote(&lock);
-        ADD_FAILURE() << "the demoter cannot read while the writer holds the lock";
-    });
-    ASSERT_TRUE(eventually(writer_in));
-    ASSERT_TRUE(blocked_on(demoter.tid(), lock.readers_ok));
-    demoter.cancel();
-    EXPECT_TRUE(demoter.join());
-    EXPECT_EQ(counts(), (Counts{-1, 0}));
-    release = true;
-    writer.join();
-    EXPECT_EQ(counts(), (Counts{0, 0}));
-}
-
-// Many threads mixing every operation: afterwards the lock is free, and no
-// two writers (or a writer and a reader) were ever inside together.
-TEST_F(Lock, MixedLoadKeepsExclusion) {
-    std::atomic<int> readers_inside{0}, writers_inside{0}, violations{0};
-    auto check_read = [&] {
-        readers_inside++;
-        if (writers_inside.load() != 0) violations++;
-        readers_inside--;
-    };
-    auto check_write = [&] {
-        if (writers_inside.fetch_add(1) != 0 || readers_inside.load() != 0) violations++;
-        writers_inside--;
-    };
-    std::vector<std::unique_ptr<Thread>> threads;
-    for (int t = 0; t < 6; ++t)
-        threads.push_back(std::make_unique<Thread>([&, t] {
-            for (int i = 0; i < 2000; ++i) {
-                switch ((i + t) % 4) {
-                case 0:
-                    sec__lock_read(&lock);
-                    check_read();
-                    sec__unlock_read(&lock);
-                    break;
-                case 1:
-                    sec__lock_write(&lock);
-                    check_write();
-                    sec__unlock_write(&lock);
-                    break;
-                case 2:
-                    sec__lock_read(&lock);
-                    check_read();
-                    sec__lock_promote(&lock);
-                    check_write();
-                    sec__lock_demote(&lock);
-                    check_read();
-                    sec__unlock_read(&lock);
-                    break;
-                default:
-                    if (sec__trylock_write(&lock) == 0) {
-                        check_write();
-                        sec__unlock_write(&lock);
-                    }
-                }
+        std::vector<std::unique_ptr<Actor>> actors;
+        for (int i = 0; i < 4; ++i) actors.push_back(std::make_unique<Actor>(&lock));
+        std::istringstream in(s[1]);
+        for (std::string step; in >> step;) {
+            SCOPED_TRACE(step);
+            Actor *a = step[0] >= 'A' && step[0] <= 'D' ? actors[step[0] - 'A'].get() : nullptr;
+            auto done = [&a] { return !a->busy(); };
+            if (step[0] == '=') {
+                const threads::Counts want(std::stoi(step.substr(1)), std::stoi(step.substr(step.find(',') + 1)));
+                ASSERT_TRUE(eventually([&] { return threads::counts(lock) == want; }));
+            } else if (step[1] == 't') {  // "Mt+", "Mt-": the try-lock takes the write hold, or fails
+                EXPECT_EQ(sec__trylock_write(&lock), step[2] == '+' ? 0 : -1);
+            } else if (step[0] == 'M') {
+                run(&lock, step[1]);
+            } else if (step == "*U") {
+                ASSERT_TRUE(eventually([&] {
+                    for (auto &b : actors)
+                        if (b && b->held() == 'w') return a = b.get(), true;
+                    return false;
+                }));
+                a->order('U');
+                ASSERT_TRUE(eventually(done));
+            } else if (step[1] == '>') {
+                ASSERT_TRUE(eventually(done));
+            } else if (step[1] == '.') {
+                EXPECT_TRUE(a->busy());
+            } else if (step[1] == 'c') {
+                ASSERT_TRUE(a->thread_.cancel());
+                actors[step[0] - 'A'].reset();
+            } else {
+                a->order(step[1]);
+                ASSERT_TRUE(eventually([&] { return step[2] == '>' ? done() : threads::waits_on(a->thread_.tid(), lock) == step[2]; }));
             }
-        }));
-    for (auto &t : threads) t->join();
-    EXPECT_EQ(violations.load(), 0);
-    EXPECT_EQ(counts(), (Counts{0, 0}));
+        }
+        actors.clear();
+        sec__lock_destroy(&lock);
+    }
 }
 
 }  // namespace
