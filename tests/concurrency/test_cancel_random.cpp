@@ -10,7 +10,7 @@
 
 #include "harness.h"
 #include "mpm.h"
-#include "oxidm_internal.h"
+#include "oxidm_state.h"
 #include "oxidm_natfile.h"
 #include "threads.h"
 

@@ -11,7 +11,7 @@
 
 #include "harness.h"
 #include "mpm.h"
-#include "oxidm_internal.h"
+#include "oxidm_state.h"
 #include "threads.h"
 
 namespace {
