@@ -143,9 +143,11 @@ extern "C" int tr_register_component_1(const char *component, unsigned char *lev
     read_env();
     Component &c = (*g_components)[component];
     c.levels = levels;
-    c.categories.clear();
-    for (int i = 0; i < count; ++i)
-        c.categories.push_back(categories && categories[i].name ? categories[i].name : "");
+    // A category is known by its number, not by its place in the array.
+    c.categories.assign(static_cast<size_t>(count), "");
+    for (int i = 0; categories != nullptr && i < count; ++i)
+        if (categories[i].name != nullptr && categories[i].number >= 0 && categories[i].number < count)
+            c.categories[static_cast<size_t>(categories[i].number)] = categories[i].name;
     apply_env_levels(component, c);
     for (int i = 0; i < count; ++i)
         if (c.has_pending[i]) levels[i] = c.pending[i];

@@ -4,6 +4,8 @@
 // the row names, with the row's record kind and item count.  With all levels
 // 0 nothing is recorded at all, and across the settings every row that such a
 // session can reach is reached.
+#include <dlfcn.h>
+
 #include <algorithm>
 #include <cstdio>
 #include <set>
@@ -17,6 +19,18 @@
 #include "oxidm_state.h"
 #include "oxidm_tracepoints.h"
 #include "test_mpm.h"
+
+// libox_tr as this program sees it: the real one, except that while
+// g_clobber is set its registration leaves an error of its own behind, as a
+// platform library may.
+bool g_clobber = false;
+extern "C" int tr_register_component_1(const char *component, unsigned char *levels, const tr_category_t *categories,
+                                       int count) {
+    using Register = int (*)(const char *, unsigned char *, const tr_category_t *, int);
+    static const auto real = reinterpret_cast<Register>(dlsym(RTLD_NEXT, "tr_register_component_1"));
+    if (g_clobber) cu_set_error_1(99, 0, "other.cat", 2, 3, "registration noise");
+    return real(component, levels, categories, count);
+}
 
 namespace {
 
@@ -163,6 +177,42 @@ TEST_F(TracePoints, NothingIsRecordedWithEveryLevelZero) {
     oxtest::set_trace_levels(0, 0, 0, 0, 0);
     session(1000);
     EXPECT_TRUE(oxtest::trace_records().empty());
+}
+
+// The first trace point registers the component once, with the five
+// categories by number, and the error pending before it is current after it.
+TEST_F(TracePoints, RegistrationKeepsThePendingErrorAndNamesTheCategories) {
+    ASSERT_EQ(trx_registrations("_SEI"), 0);
+    cu_set_error_1(idm::kNodeFileInvalid, 0, "oxseclib.cat", 1, idm::kMsg690, cu_mesgtbl_oxseclib_msg[idm::kMsg690]);
+    g_clobber = true;
+    EXPECT_EQ(idm__trace_routine_end("", 0), 0);
+    g_clobber = false;
+    idm__trace_routine_end(nullptr, 0);
+    EXPECT_EQ(trx_registrations("_SEI"), 1);
+    EXPECT_TRUE(oxtest::reported(idm::kNodeFileInvalid, idm::kMsg690, {}));
+    for (int c = 0; c < 5; ++c) EXPECT_STREQ(trx_category_name("_SEI", c), idm::trace::kCategoryNames[c]);
+}
+
+// The end of a routine: its name as a text at API level 1, name and status
+// as data at level 8, nothing at other levels or without a name.
+TEST_F(TracePoints, RoutineEndRecordsTheNameAndTheStatus) {
+    struct Row {
+        unsigned char api;
+        const char *name;
+        int kind;  // 0: nothing recorded
+    } rows[] = {{1, "idm__x", TRX_STRINGS}, {8, "idm__x", TRX_DATA}, {2, "idm__x", 0}, {8, "", 0}, {8, nullptr, 0}};
+    for (const Row &r : rows) {
+        oxtest::reset_trace();
+        oxtest::set_trace_levels(0, r.api, 0, 0, 0);
+        idm__trace_routine_end(r.name, -5);
+        const auto records = oxtest::trace_records();
+        ASSERT_EQ(records.size(), r.kind == 0 ? 0u : 1u) << int(r.api);
+        if (r.kind == 0) continue;
+        EXPECT_EQ(records[0].kind, r.kind);
+        EXPECT_EQ(records[0].items[0], std::string("idm__x", 7));
+        if (r.kind == TRX_DATA) EXPECT_EQ(records[0].i32(1), -5);
+        if (r.kind == TRX_DATA) EXPECT_EQ(records[0].items[1].size(), 4u);
+    }
 }
 
 TEST_F(TracePoints, TheTableHasOneRowPerIdAndNoLevelsOutsideItsCategory) {
