@@ -71,6 +71,7 @@ struct Row {
     int recorded;          // status given with the report
     std::string now;
     std::set<std::string> next;
+    std::set<std::string> sizes = {};  // second insert, when the row names the sizes of its allocations
     int hits = 0;
 };
 
@@ -120,7 +121,8 @@ inline long run(const Operation &op, std::vector<Row> &rows, long limit = 400) {
         Row *row = nullptr;
         for (Row &r : rows)
             if (r.msgno == e.msgno && (*r.function == '\0' ? e.inserts.empty()
-                                                             : e.inserts.size() == 2 && e.inserts[0] == r.function))
+                                                             : e.inserts.size() == 2 && e.inserts[0] == r.function &&
+                                                                   (r.sizes.empty() || r.sizes.count(e.inserts[1]))))
                 row = &r;
         if (row == nullptr) {
             ADD_FAILURE() << "no row for message " << e.msgno << " inserts " << ::testing::PrintToString(e.inserts);

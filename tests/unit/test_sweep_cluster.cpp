@@ -45,8 +45,8 @@ TEST_F(SweepCluster, LoadOfSeveralRecords) {
     // After a failure the file counts as read and the host is not listed until it changes.
     const std::string fresh = "0 v clA", nomem = sweep::st(idm::kNoMemory), unchanged = sweep::st(idm::kUnchanged);
     std::vector<sweep::Row> rows = {
-        {"file buffer: the trees keep the old version", idm::kMsg654, "idm__read_clmap_file", idm::kNoMemory,
-         nomem, {"0 old"}},
+        {"file buffer, the file's size and its NUL: the trees keep the old version", idm::kMsg654,
+         "idm__read_clmap_file", idm::kNoMemory, nomem, {"0 old"}, {std::to_string(new_text().size() + 1)}},
         {"working list and its growth", idm::kMsg654, "idm__construct_clcfg", idm::kNoMemory, nomem, {unchanged}},
         {"value copy", idm::kMsg654, "idm__extract_attr_value", idm::kNoMemory, nomem, {unchanged}},
         {"tree record, while storing or for the query's probe", idm::kMsg654, "idm__getnode", idm::kNoMemory, nomem,

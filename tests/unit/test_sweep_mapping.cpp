@@ -73,7 +73,10 @@ class SweepMapping : public oxtest::Test {
 TEST_F(SweepMapping, PassOverTwoFilesWithRulesCached) {
     const std::string jl = "0 jl";
     std::vector<Row> rows = {
-        {"map file set", idm::kMsg654, "idm__native_get_mapfile_names", idm::kNoMemory, st(idm::kNoMemory, " "), {jl}},
+        {"map file set: the record, the names array, the three paths, the per-file arrays", idm::kMsg654,
+         "idm__native_get_mapfile_names", idm::kNoMemory, st(idm::kNoMemory, " "), {jl},
+         {std::to_string(sizeof(idm_mapfile_set)), std::to_string(3 * sizeof(char *)), "28", "29", "32",
+          std::to_string(3 * sizeof(uint32_t))}},
         {"identifier copy", idm::kMsg658, "idm__read_mapfile_entries", idm::kInternal, st(idm::kInternal, " "), {jl}},
         {"entry list growth", idm::kMsg658, "idm_alloc_entries", idm::kInternal, st(idm::kNoMemory, " "), {jl}},
         {"rule cache growth", idm::kMsg654, "idm__native_cache_rule", idm::kNoMemory, jl, {jl}},
