@@ -247,12 +247,4 @@ TEST_F(TracePoints, DumpsOfARuleAndAnIdShowEveryFieldAndNullAsItsText) {
     EXPECT_TRUE(dump(idm__trace_native_id, static_cast<const idm_id *>(nullptr)).empty());
 }
 
-TEST_F(TracePoints, TheTableHasOneRowPerIdAndNoLevelsOutsideItsCategory) {
-    std::set<int> ids;
-    for (const TracePoint &p : kTracePoints) {
-        EXPECT_TRUE(ids.insert(p.id).second) << "id " << p.id << " twice";
-        EXPECT_NE(p.levels, 0) << p.name;
-    }
-}
-
 }  // namespace

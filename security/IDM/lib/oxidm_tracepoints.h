@@ -13,6 +13,7 @@
 #ifndef OXIDM_TRACEPOINTS_H
 #define OXIDM_TRACEPOINTS_H
 
+#include <cstddef>
 #include <cstdint>
 
 // clang-format off
@@ -202,6 +203,17 @@ constexpr const TracePoint *find_point(int id) {
         if (p.id == id) return &p;
     return nullptr;
 }
+
+// Every id stands once, and every row names a level that records it.
+constexpr bool table_is_sound() {
+    for (size_t i = 0; i < sizeof kTracePoints / sizeof kTracePoints[0]; ++i) {
+        if (kTracePoints[i].levels == 0) return false;
+        for (size_t j = 0; j < i; ++j)
+            if (kTracePoints[j].id == kTracePoints[i].id) return false;
+    }
+    return true;
+}
+static_assert(table_is_sound(), "a trace id stands twice, or a row names no level");
 
 // Whether a point is recorded at these levels of the five categories.
 constexpr bool recorded_at(const TracePoint &p, const unsigned char (&levels)[5]) {
