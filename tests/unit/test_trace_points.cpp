@@ -210,8 +210,10 @@ TEST_F(TracePoints, RoutineEndRecordsTheNameAndTheStatus) {
         if (r.kind == 0) continue;
         EXPECT_EQ(records[0].kind, r.kind);
         EXPECT_EQ(records[0].items[0], std::string("idm__x", 7));
-        if (r.kind == TRX_DATA) EXPECT_EQ(records[0].i32(1), -5);
-        if (r.kind == TRX_DATA) EXPECT_EQ(records[0].items[1].size(), 4u);
+        if (r.kind == TRX_DATA) {
+            EXPECT_EQ(records[0].i32(1), -5);
+            EXPECT_EQ(records[0].items[1].size(), 4u);
+        }
     }
 }
 
