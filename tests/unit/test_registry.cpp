@@ -32,10 +32,8 @@ TEST(Registry, MutexThatCannotBeMadeLeavesTheListUnchanged) {
     }
     idm_test_fail_mutex_init(0);
     for (const char *m : {"one", "two", "three"}) ASSERT_EQ(sec_idm_register_translator(1, m, translator_a, cleanup_a), 0);
-    EXPECT_EQ(idm__native_state.translator_count, 3u);
     EXPECT_STREQ(idm__native_state.translators->mnemonic, "three");
     EXPECT_EQ(idm__native_find_translator("two"), idm__native_state.translators->next);
-    EXPECT_EQ(idm__native_find_translator("Two"), nullptr);
 }
 
 TEST(Registry, ConcurrentRegistrationOfOneMnemonicMakesOneRecord) {
