@@ -39,13 +39,13 @@ TEST(MappingPlugins, HostAndPrincipalIdentities) {
         {"host", "alice@node1", 0, "alice"},  {"host", "bob@NODE1", 0, "bob"},  // host names are folded
         {"host", "Bob@node1", 0, "Bob"},      {"host", "mallory@node1", 0, ""},  // the denial comes first
         {"host", "carol@web.example.org", 0, "guest"}, {"host", "root@db", 0, "admin"},
-        {"host", "dave@elsewhere", 0, "nobody"},       {"host", "a@b@c", 38, ""},
+        {"host", "dave@elsewhere", 0, "nobody"},       {"host", "a@b@c", IDM_E_RULE, ""},
         {"princ", "joe@EXAMPLE.ORG", 0, "joe"},        {"princ", "amy/root@EXAMPLE.ORG", 0, ""},
         {"princ", "amy/admin@EXAMPLE.ORG", 0, "root"}, {"princ", "joe/web@EXAMPLE.ORG", 0, "web"},
         {"princ", "ann@EXAMPLE.ORG", 0, "ann"},        {"princ", "ann@DEV.EXAMPLE.ORG", 0, "guest"},
         {"princ", "ann@example.org", 0, ""},           // realms are case-sensitive
         {"princ", "amy/web@EXAMPLE.ORG", 0, ""},       // two tokens could name the user: unusable
-        {"princ", "no-realm", 38, ""},
+        {"princ", "no-realm", IDM_E_RULE, ""},
     });
 }
 

@@ -1,8 +1,9 @@
 // The argument checks of every routine that has them, in one table: the
-// exported functions (and the token matcher) refuse a bad argument with 4 and
-// 2650-650, the internal routines with 2650-651 (status 23, or 4 for the change
-// test), naming the routine, the position of the first bad argument and its
-// value; nothing the caller passed is written.
+// exported functions (and the token matcher) refuse a bad argument as a bad
+// parameter with 2650-650, the internal routines as an internal failure with
+// 2650-651 (the change test: a bad parameter, answering "unchanged"), naming
+// the routine, the position of the first bad argument and its value; nothing
+// the caller passed is written.
 #include <cstdio>
 #include <string>
 
@@ -69,7 +70,7 @@ TEST(Arguments, EveryCheckedRoutineNamesTheFirstBadArgument) {
         {"idm__alloc_entries", [](int) { return idm__alloc_entries(0, nullptr); }, 2, 2, kInt, kInt, k651, 0},
         {"idm__native_read_mapfiles", [](int k) { return idm__native_read_mapfiles(ok(k, 1, "m"), ok(k, 2, &g_set), ok(k, 3, &g_n), nullptr); }, 1, 4, kInt, kInt, k651, 0},
         {"idm__native_read_mapfiles", [](int) { return idm__native_read_mapfiles(kEmpty, &g_set, &g_n, &g_entries); }, 1, 1, kInt, kInt, k651, at(kEmpty)},
-        {"idm__native_test_mapfiles", [](int) { return idm__native_test_mapfiles(nullptr); }, 1, 1, 1, kBad, k651, 0},
+        {"idm__native_test_mapfiles", [](int) { return idm__native_test_mapfiles(nullptr); }, 1, 1, idm::kUnchanged, kBad, k651, 0},
         {"idm__native_test_mapfiles_v1", [](int) { return idm__native_test_mapfiles_v1(nullptr, -1, -2); }, 1, 1, kInt, kInt, k651, 0},
         {"idm__native_test_mapfiles_v1", [](int) { return idm__native_test_mapfiles_v1(&g_hollow, 0, -1); }, 1, 1, kInt, kInt, k651, at(&g_hollow)},
         {"idm__native_test_mapfiles_v1", [](int) { return idm__native_test_mapfiles_v1(g_set, -1, -2); }, 2, 2, kInt, kInt, k651, 0xffffffff},

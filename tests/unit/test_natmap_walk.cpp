@@ -32,7 +32,8 @@ int32_t translate(const idm_mapfile_entry *entry, const char *network_id, idm_ru
                  entry->local_id ? mapping_of(entry->local_id) : nullptr};
     }
     *id = {heap_copy("test"), heap_copy("r"), 1, one_token(network_id)};
-    if (status != 0 && status != 31 && status != 38 && status != 39) free_rule_and_id(entry ? rule : nullptr, id);
+    if (status != 0 && status != IDM_TRANSLATOR_STOP && status != IDM_TRANSLATOR_REJECT && status != IDM_TRANSLATOR_REFUSED)
+        free_rule_and_id(entry ? rule : nullptr, id);
     return status;
 }
 template <char Tag>
@@ -43,6 +44,7 @@ int32_t cleanup(idm_rule *rule, idm_id *id) {
 }
 
 class NatmapWalk : public Test {};
+constexpr int32_t kStop = IDM_TRANSLATOR_STOP, kReject = IDM_TRANSLATOR_REJECT, kOther = 5;  // "5.": any other
 
 // Each step writes a file (or removes it: "-"), or runs a hook, then maps
 // and checks the status, the local name ("" for none) and the calls logged.
@@ -57,19 +59,19 @@ TEST_F(NatmapWalk, StepsThroughFilesStatusesAndTheCache) {
         {kLocalMap, "-", "joe", 0, "", "C rule:alice;C rule:bob;C rule:joe;C rule:zed;"},  // old cache, in order
         {kLocalMap, "other:joe=x\ntestx:joe=x\nTEST:joe=x\ntest:!joe\ntest:joe=root\n", "joe", 0, "", "T joe;C id:joe;"},
         {kLocalMap, "test:!bob\ntest:j*=*\n", "joe", 0, "joe", "C rule:joe;T bob;C id:joe;T j*;C id:joe;"},
-        {kLocalMap, "test:31.joe=x\ntest:joe=root\n", "joe", 31, "", "C rule:bob;C rule:j*;T 31.joe;C id:joe;"},
+        {kLocalMap, "test:31.joe=x\ntest:joe=root\n", "joe", kStop, "", "C rule:bob;C rule:j*;T 31.joe;C id:joe;"},
         {nullptr, nullptr, "joe", 0, "x", "T -:joe;C id:joe;"},  // the rule of a 31 is cached when valid
-        {nullptr, nullptr, "#31", 31, "", "T -:joe;C id:#31;"},  // 31 for a cached rule stops the walk too
+        {nullptr, nullptr, "#31", kStop, "", "T -:joe;C id:#31;"},  // 31 for a cached rule stops the walk too
         // 39 refuses the rule (released at once), two wildcards fail the check, 38 with a valid rule is
         // cached as valid, any other status passes the entry over without a cleanup call.
         {kLocalMap, "test:39.joe=x\ntest:0.**=y\ntest:38.j*=z\ntest:5.joe=q\ntest:joe=root\n", "joe", 0, "root",
          "C rule:joe;T 39.joe;C rule:joe;C id:joe;T 0.**;C id:joe;T 38.j*;C id:joe;T 5.joe;T joe;C id:joe;"},
         {nullptr, nullptr, "joe", 0, "z", "T -:j*;C id:joe;"},  // unusable rules cost no call
         {nullptr, nullptr, "amy", 0, "", "T -:j*;C id:amy;T 5.joe;T -:joe;C id:amy;"},
-        {kLocalMap, "test:bob=b\ntest:amy=a\n", "#38", 38, "",  // the last status when nothing matched
+        {kLocalMap, "test:bob=b\ntest:amy=a\n", "#38", kReject, "",  // the last status when nothing matched
          "C rule:?;C rule:**;C rule:j*;C rule:joe;T bob;C id:#38;T amy;C id:#38;"},
-        {kLocalMap, "test:bob=b\ntest:5.amy=a\n", "joe", 5, "", "C rule:bob;C rule:amy;T bob;C id:joe;T 5.amy;"},
-        {kLocalMap, "test:31.a*b*=x\n", "joe", 31, "", "C rule:bob;T 31.a*b*;C id:joe;"},
+        {kLocalMap, "test:bob=b\ntest:5.amy=a\n", "joe", kOther, "", "C rule:bob;C rule:amy;T bob;C id:joe;T 5.amy;"},
+        {kLocalMap, "test:31.a*b*=x\n", "joe", kStop, "", "C rule:bob;T 31.a*b*;C id:joe;"},
         {nullptr, nullptr, "joe", 0, "", ""},  // its rule failed the check: passed over
         {kLocalMap, "test:!amy\ntest:j*=from-local\n", "joe", 0, "from-local", nullptr},
         {kOptGlobalMap, "test:joe=from-opt\n", "joe", 0, "from-local", nullptr},  // the local file first
@@ -78,8 +80,8 @@ TEST_F(NatmapWalk, StepsThroughFilesStatusesAndTheCache) {
         {kVarGlobalMap, "test:joe=from-var\n", "joe", 0, "from-var", nullptr},  // supersedes the other global
         // A read error drops entries and rules, and stands (never "no match") until the file reads.
         {kLocalMap, "test:bob=b\ntest:joe=j\n", "joe", 0, "j", nullptr},
-        {nullptr, nullptr, "joe", 36, "", "C rule:bob;C rule:joe;", [] { mssx_force_open(kLocalMap, 12), set_mtime(kLocalMap, 2'000'000); }},
-        {nullptr, nullptr, "joe", 36, "", ""},
+        {nullptr, nullptr, "joe", IDM_E_MAPFILE_ACCESS, "", "C rule:bob;C rule:joe;", [] { mssx_force_open(kLocalMap, 12), set_mtime(kLocalMap, 2'000'000); }},
+        {nullptr, nullptr, "joe", IDM_E_MAPFILE_ACCESS, "", ""},
         {nullptr, nullptr, "joe", 0, "j", "T bob;C id:joe;T joe;C id:joe;", [] { mssx_force_open(nullptr, 0); }},
         // Routines registered anew inherit the cache, and release it.
         {nullptr, nullptr, "joe", 0, "j", "BT -:bob;BC id:joe;BT -:joe;BC id:joe;",
