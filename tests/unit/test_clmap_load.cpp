@@ -14,6 +14,8 @@
 #include <atomic>
 #include <string>
 #include <thread>
+#include <tuple>
+#include <utility>
 #include <vector>
 
 #include "harness.h"
@@ -24,13 +26,15 @@ namespace {
 
 using oxtest::kNodeInfo;
 
+using idm::kOk, idm::kUnchanged, idm::kNodeFileInvalid, idm::kNoMemory;
+
 // Status and clusters ("a,b") of one lookup.
-std::string lookup(const char *host) {
+std::pair<int32_t, std::string> lookup(const char *host) {
     idm::clmap::MapHold hold(&idmutex);
     char **clusters = nullptr;
     int32_t count = -1;
-    std::string r = std::to_string(sec__get_cluster_names(hold, host, &clusters, &count));
-    for (int32_t i = 0; i < count; ++i) r += (i ? "," : " ") + std::string(clusters[i]);
+    std::pair<int32_t, std::string> r{sec__get_cluster_names(hold, host, &clusters, &count), ""};
+    for (int32_t i = 0; i < count; ++i) r.second += (i ? "," : "") + std::string(clusters[i]);
     return r;
 }
 
@@ -61,42 +65,41 @@ TEST_F(ClusterFile, Script) {
         std::string text;
         int64_t time;  // file time (kClock: the clock)
         const char *host;
-        std::string answer;  // status and clusters
+        int32_t status;
+        const char *clusters;  // "a,b"
         int msg;             // reported with the status (0: nothing)
         uint32_t trees;      // names * 1000 + addresses
         int64_t lastmod;
         std::vector<std::string> inserts = {};
     } steps[] = {
-        {"no file", kKeep, "", 0, "hosta", "1", 0, 0, 0},
-        {"by name", kWrite, kExample, 1000, "hosta-alt", "0 clA,clB", 0, 2003, 1000},
-        {"by address", kKeep, "", 0, "fd00::1", "0 clA,clB", 0, 2003, 1000},
-        {"address texts exactly", kKeep, "", 0, "fd00:0::1", "1", 0, 2003, 1000},
-        {"null host", kKeep, "", 0, nullptr, "1", 0, 2003, 1000},
-        {"an address among addresses", kWrite, kSplit, 1001, "10.0.0.9", "1", 0, 2001, 1001},
-        {"a name among names", kKeep, "", 0, "plain2", "1", 0, 2001, 1001},
-        {"a name", kKeep, "", 0, "plain", "0 c", 0, 2001, 1001},
-        {"same second: not read", kSameSecond, "NODE:\nNAME: h\nCLUSTER: v2\n", 1001, "plain", "0 c", 0, 2001, 1001},
-        {"an earlier time is a change", kTouch, "", 900, "h", "0 v2", 0, 1000, 900},
-        {"removed: empty, time kept", kRemove, "", 0, "h", "1", 0, 0, 900},
-        {"back with that time: not read", kWrite, "NODE:\nNAME: h\nCLUSTER: v2\n", 900, "h", "1", 0, 0, 900},
-        {"empty file", kWrite, "", 2000, "h", "1", 0, 0, 2000},
-        {"comments only", kWrite, "# c\n\n \t\n", 3000, "h", "1", 0, 0, 3000},
-        {"loaded", kWrite, kExample, 4000, "hosta", "0 clA,clB", 0, 2003, 4000},
-        {"invalid: empty trees", kWrite, std::string(kExample) + "NODE:\n", 4001, "hosta", "21", idm::kMsg690, 0, 4001},
-        {"invalid: not read again", kKeep, "", 0, "hosta", "1", 0, 0, 4001},
-        {"valid again", kWrite, kExample, 4002, "hosta", "0 clA,clB", 0, 2003, 4002},
-        {"stat fails", kLoop, "", 0, "hosta", "21", idm::kMsg692, 2003, 4002},
-        {"a directory", kDir, "", 0, "hosta", "21", idm::kMsg693, 2003, 4002},
-        {"a directory, every query", kKeep, "", 0, "hosta", "21", idm::kMsg693, 2003, 4002},
-        {"a link to nothing", kDangling, "", 0, "hosta", "21", idm::kMsg693, 2003, 4002},
-        {"open fails", kNoDescriptor, kSplit, 5001, "hosta", "21", idm::kMsg693, 2003, 5001},
-        {"open failed: not retried", kKeep, "", 0, "plain", "1", 0, 2003, 5001},
-        {"a cut line just written", kWrite, "NODE:\nNAME: cut\nCLUSTER: c", 5999, "cut", "1", 0, 2003, INT64_MIN},
-        {"read again at the next query", kClock, "", 6001, "cut", "0 c", 0, 1000, 5999},
-        {"a list grows past 32", kWrite, "NODE:\nCLUSTER: c\nNAME:" + words("n", 70) + "\n", 7000, "n69", "0 c", 0, 70000,
+        {"no file", kKeep, "", 0, "hosta", kUnchanged, "", 0, 0, 0},
+        {"by name", kWrite, kExample, 1000, "hosta-alt", kOk, "clA,clB", 0, 2003, 1000},
+        {"by address", kKeep, "", 0, "fd00::1", kOk, "clA,clB", 0, 2003, 1000},
+        {"address texts exactly", kKeep, "", 0, "fd00:0::1", kUnchanged, "", 0, 2003, 1000},
+        {"null host", kKeep, "", 0, nullptr, kUnchanged, "", 0, 2003, 1000},
+        {"an address among addresses", kWrite, kSplit, 1001, "10.0.0.9", kUnchanged, "", 0, 2001, 1001},
+        {"a name among names", kKeep, "", 0, "plain2", kUnchanged, "", 0, 2001, 1001},
+        {"a name", kKeep, "", 0, "plain", kOk, "c", 0, 2001, 1001},
+        {"same second: not read", kSameSecond, "NODE:\nNAME: h\nCLUSTER: v2\n", 1001, "plain", kOk, "c", 0, 2001, 1001},
+        {"an earlier time is a change", kTouch, "", 900, "h", kOk, "v2", 0, 1000, 900},
+        {"removed: empty, time kept", kRemove, "", 0, "h", kUnchanged, "", 0, 0, 900},
+        {"back with that time: not read", kWrite, "NODE:\nNAME: h\nCLUSTER: v2\n", 900, "h", kUnchanged, "", 0, 0, 900},
+        {"empty file", kWrite, "", 2000, "h", kUnchanged, "", 0, 0, 2000},
+        {"loaded", kWrite, kExample, 4000, "hosta", kOk, "clA,clB", 0, 2003, 4000},
+        {"invalid: empty trees", kWrite, std::string(kExample) + "NODE:\n", 4001, "hosta", kNodeFileInvalid, "", idm::kMsg690, 0, 4001},
+        {"invalid: not read again", kKeep, "", 0, "hosta", kUnchanged, "", 0, 0, 4001},
+        {"valid again", kWrite, kExample, 4002, "hosta", kOk, "clA,clB", 0, 2003, 4002},
+        {"stat fails", kLoop, "", 0, "hosta", kNodeFileInvalid, "", idm::kMsg692, 2003, 4002},
+        {"a directory", kDir, "", 0, "hosta", kNodeFileInvalid, "", idm::kMsg693, 2003, 4002},
+        {"a link to nothing", kDangling, "", 0, "hosta", kNodeFileInvalid, "", idm::kMsg693, 2003, 4002},
+        {"open fails", kNoDescriptor, kSplit, 5001, "hosta", kNodeFileInvalid, "", idm::kMsg693, 2003, 5001},
+        {"open failed: not retried", kKeep, "", 0, "plain", kUnchanged, "", 0, 2003, 5001},
+        {"a cut line just written", kWrite, "NODE:\nNAME: cut\nCLUSTER: c", 5999, "cut", kUnchanged, "", 0, 2003, INT64_MIN},
+        {"read again at the next query", kClock, "", 6001, "cut", kOk, "c", 0, 1000, 5999},
+        {"a list grows past 32", kWrite, "NODE:\nCLUSTER: c\nNAME:" + words("n", 70) + "\n", 7000, "n69", kOk, "c", 0, 70000,
          7000},
         {"the record budget", kWrite, "NODE:\nNAME:" + words("n", 3000) + "\nCLUSTER:" + words("c", 3000) + "\n", 8000,
-         "n0", "6", idm::kMsg654, 0, 8000, {"idm__getnode", "24000"}},
+         "n0", kNoMemory, "", idm::kMsg654, 0, 8000, {"idm__getnode", "24000"}},
     };
     cux_set_clock(6000);
     for (const auto &s : steps) {
@@ -123,9 +126,9 @@ TEST_F(ClusterFile, Script) {
         getrlimit(RLIMIT_NOFILE, &saved);
         const struct rlimit tight = {rlim_t(lowest), saved.rlim_max};
         if (s.act == kNoDescriptor) { ASSERT_EQ(setrlimit(RLIMIT_NOFILE, &tight), 0); }
-        EXPECT_EQ(lookup(s.host), s.answer);
+        EXPECT_EQ(lookup(s.host), std::pair(s.status, std::string(s.clusters)));
         setrlimit(RLIMIT_NOFILE, &saved);
-        EXPECT_TRUE(s.msg ? oxtest::reported(std::stoi(s.answer), s.msg, s.inserts) : oxtest::nothing_but_list_ends());
+        EXPECT_TRUE(s.msg ? oxtest::reported(s.status, s.msg, s.inserts) : oxtest::nothing_but_list_ends());
         EXPECT_EQ(nametree.rst_node_cnt * 1000 + iptree.rst_node_cnt, s.trees);
         EXPECT_EQ(lastmod, s.lastmod);
     }
@@ -136,7 +139,7 @@ TEST_F(ClusterFile, Script) {
 // A file read while it grew is read again, three times at most; then the load
 // fails with 2650-694, keeps the trees and is tried again at the next query.
 TEST_F(ClusterFile, AFileChangedWhileReadIsReadAgain) {
-    for (const auto &[appends, answer] : {std::pair{1, "0 d"}, {100, "21"}}) {
+    for (const auto &[appends, status, clusters] : {std::tuple{1, kOk, "d"}, {100, kNodeFileInvalid, ""}}) {
         oxtest::write_file(kNodeInfo, "#" + std::string(5000, 'x') + "\nNODE:\nNAME: early\nCLUSTER: c\n",
                            2000 + appends);
         const int fan = fanotify_init(FAN_CLASS_CONTENT | FAN_CLOEXEC, O_RDWR);
@@ -159,9 +162,9 @@ TEST_F(ClusterFile, AFileChangedWhileReadIsReadAgain) {
             }
         });
         oxtest::clear_errors();
-        EXPECT_EQ(lookup("late999"), answer);
+        EXPECT_EQ(lookup("late999"), std::pair(int32_t{status}, std::string(clusters)));
         done = true;
-        EXPECT_TRUE(appends == 1 ? oxtest::nothing_but_list_ends() : oxtest::reported(idm::kNodeFileInvalid, idm::kMsg694, {}));
+        EXPECT_TRUE(appends == 1 ? oxtest::nothing_but_list_ends() : oxtest::reported(kNodeFileInvalid, idm::kMsg694, {}));
         EXPECT_EQ(lastmod, appends == 1 ? 2001 : INT64_MIN);
         handler.join();
         close(fan);
