@@ -5,6 +5,7 @@
 
 #include "harness.h"
 #include "oxidm.h"
+#include "oxseclib_msg.h"
 
 namespace {
 
@@ -52,7 +53,7 @@ TEST_F(ClusterQueries, AFailedLoadIsReportedOnlyByTheQueryThatRanIt) {
     cux_set_active_cluster("clA");
     oxtest::write_file(kNodeInfo, std::string(kFile) + "CLUSTER: stray\n", 1000);
     EXPECT_EQ(sec_is_in_active_cluster("hosta"), -1);
-    EXPECT_TRUE(oxtest::reported(IDM_E_NODE_FILE, 315 /* 2650-690 */, {}));
+    EXPECT_TRUE(oxtest::reported(IDM_E_NODE_FILE, idm::kMsg690, {}));
     oxtest::clear_errors();
     EXPECT_EQ(sec_is_in_active_cluster("hosta"), -1);
     EXPECT_EQ(sec_is_in_any_cluster("hosta"), -1);
