@@ -1,7 +1,7 @@
 // Group membership lookups (sec_idm_get_groups) against nss_wrapper
 // databases: users and databases -> groups, or the failure reported once
 // with empty outputs (getgrent_r errors are injected between the library
-// and nss_wrapper); the precedence of failures; the allocation-failure sweep
+// and nss_wrapper); the allocation-failure sweep
 // of a lookup; lookups from several threads; a thread cancelled mid-scan.
 #include <dlfcn.h>
 #include <grp.h>
@@ -23,7 +23,6 @@
 namespace {
 
 using oxtest::num;
-using Names = std::vector<std::string>;
 
 // From call number g_fail_at on, g_fail_times getgrent_r calls fail with
 // g_fail_error (as the result, or as errno with -1); call g_block_at waits
@@ -204,24 +203,6 @@ TEST_F(Groups, UsersToGroupsOrTheFailure) {
     }
 }
 
-// An append failure lets the scan go on; a later enumeration failure is the
-// last failure recorded and gives the status.
-TEST_F(Groups, LastFailureGivesTheStatus) {
-    ASSERT_EQ(groups_of("alice"), kAlice);  // once-controls outside the count
-    oxtest::clear_errors();
-    reset_interposition();
-    idm_test_fail_alloc(6);  // growing the array for "zeta", 1st group
-    g_fail_errno.store(false);
-    g_fail_error.store(EIO);
-    g_fail_times.store(1);
-    g_fail_at.store(9);  // in place of "solo", 9th group
-    EXPECT_EQ(groups_of("alice"), kFailed);
-    idm_test_fail_alloc(0);
-    EXPECT_EQ(oxtest::reports_since_clear(), 2u);
-    EXPECT_TRUE(oxtest::reported(idm::kGroupsUnavailable, idm::kMsg700, {std::to_string(EIO)}));
-    EXPECT_EQ(g_getgrent.load(), 9) << "the scan went on after the append failure";
-}
-
 // Every allocation of a lookup for a user in a dozen groups fails in turn
 // (2650-654 of the lookup, status 6, empty outputs); the scan lock is free
 // afterwards and the next lookup is whole.
@@ -239,10 +220,7 @@ TEST_F(Groups, SweepEveryAllocationOfALookup) {
     ASSERT_EQ(groups_of("many"), right);  // once-controls outside the count
     std::vector<sweep::Row> rows = {
         {"any allocation", idm::kMsg654, "idm__native_get_groups", idm::kNoMemory, sweep::st(idm::kNoMemory), {right}}};
-    sweep::Operation op{
-        [](long) {},
-        [] { return groups_of("many"); },
-        right,
+    sweep::Operation op{[](long) {}, [] { return groups_of("many"); }, right,
         [] {  // the scan lock is free: another thread's lookup completes
             auto other = std::async(std::launch::async, [] { return groups_of("none"); });
             if (other.wait_for(std::chrono::seconds(20)) != std::future_status::ready) {

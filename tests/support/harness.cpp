@@ -63,14 +63,11 @@ static ::testing::AssertionResult nothing_but(int status, int msgno) {
 ::testing::AssertionResult nothing_reported() { return nothing_but(-1, -1); }
 ::testing::AssertionResult nothing_but_list_ends() { return nothing_but(21, 315); }
 
-template <class T>
-static T item(const std::vector<std::string> &items, size_t j) {
-    T v = 0;
+int32_t TraceRecord::i32(size_t j) const {
+    int32_t v = 0;
     if (j < items.size() && items[j].size() == sizeof v) std::memcpy(&v, items[j].data(), sizeof v);
     return v;
 }
-int32_t TraceRecord::i32(size_t j) const { return item<int32_t>(items, j); }
-uint64_t TraceRecord::u64(size_t j) const { return item<uint64_t>(items, j); }
 std::string TraceRecord::text(size_t j) const {
     if (j >= items.size() || items[j].empty() || items[j].back() != '\0') return "<not a text>";
     return items[j].substr(0, items[j].size() - 1);

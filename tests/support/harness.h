@@ -55,7 +55,6 @@ struct TraceRecord {
     int kind;  // TRX_ID, TRX_DATA, TRX_STRINGS
     std::vector<std::string> items;  // raw bytes, texts with their NUL
     int32_t i32(size_t j) const;
-    uint64_t u64(size_t j) const;
     std::string text(size_t j) const;  // without the NUL
 };
 std::vector<TraceRecord> trace_records();
@@ -82,7 +81,6 @@ int run_in_child(void (*body)(void *), void *arg);
 extern "C" {
 void idm_test_fail_alloc(long nth);  // the nth allocation from now fails (0: off)
 int idm_test_alloc_fired(void);
-long idm_test_alloc_calls(void);
 void idm_test_fail_mutex_init(int result);
 void idm_test_on_secret_free(void (*hook)(const void *, size_t));
 }

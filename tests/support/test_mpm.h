@@ -43,28 +43,22 @@ inline idm_buffer *mapping_of(const char *local) {
     return new (std::malloc(sizeof(idm_buffer))) idm_buffer{static_cast<uint32_t>(std::strlen(local) + 1), heap_copy(local)};
 }
 
-// Free what a test translator put in a rule or an id (one token at most)
-// and clear the record.
-template <class T>
-inline void free_texts(T *r) {
-    std::free(r->rgy_type);
-    std::free(r->rgy);
-    if (r->tokens != nullptr) std::free(r->tokens[0]);
-    std::free(r->tokens);
-    *r = T{};
-}
-inline void free_rule(idm_rule *rule) {
-    if (rule == nullptr) return;
-    if (rule->mapping != nullptr) std::free(rule->mapping->value);
-    std::free(rule->mapping);
-    free_texts(rule);
-}
-inline void free_id(idm_id *id) {
-    if (id != nullptr) free_texts(id);
-}
+// Frees what a test translator put in a rule and an id (one token at most)
+// and clears both records.
 inline int32_t free_rule_and_id(idm_rule *rule, idm_id *id) {
-    free_rule(rule);
-    free_id(id);
+    auto texts = [](auto *r) {
+        std::free(r->rgy_type);
+        std::free(r->rgy);
+        if (r->tokens != nullptr) std::free(r->tokens[0]);
+        std::free(r->tokens);
+        *r = {};
+    };
+    if (rule != nullptr) {
+        if (rule->mapping != nullptr) std::free(rule->mapping->value);
+        std::free(rule->mapping);
+        texts(rule);
+    }
+    if (id != nullptr) texts(id);
     return 0;
 }
 

@@ -1,12 +1,17 @@
 // Allocation-failure sweeps of the mapping service: a whole mapping pass
 // (the map file set made, a local and a global file read, the entry list and
-// the rule cache grown past ten, the result copied) and a registration.
+// the rule cache grown past ten, the result copied) and a registration; and
+// the blocks that held an identity or a path, freed zeroed.
+#include <pwd.h>
+#include <unistd.h>
+
 #include <cstdlib>
 #include <cstring>
 #include <string>
 
 #include "oxidm_state.h"
 #include "oxidm_natfile.h"
+#include "oxidm_natmap.h"
 #include "test_sweep.h"
 
 namespace {
@@ -144,6 +149,70 @@ TEST_F(SweepMapping, Registration) {
         },
     };
     EXPECT_EQ(sweep::run(op, rows), 2);
+}
+
+// Every block that held an identity or a path goes through the zeroing free
+// (whose hook sees it) and is all zero there.
+using Blocks = std::vector<std::pair<const void *, size_t>>;
+Blocks g_routed;
+void on_secret_free(const void *p, size_t n) {
+    sweep::check_zeroed(p, n);
+    g_routed.emplace_back(p, n);
+}
+// Each block of `wanted` was routed once, and `others` more blocks besides.
+void expect_routed(const Blocks &wanted, size_t others = 0) {
+    for (const auto &block : wanted) EXPECT_EQ(std::count(g_routed.begin(), g_routed.end(), block), 1);
+    EXPECT_EQ(g_routed.size(), wanted.size() + others);
+    EXPECT_EQ(sweep::g_unzeroed.exchange(0), 0) << "a block freed unzeroed";
+    g_routed.clear();
+}
+
+using Zeroed = SweepMapping;
+TEST_F(Zeroed, IdentifiersPathsResultsAndGroupBuffers) {
+    ASSERT_EQ(sec_idm_register_translator(1, "zr", translate, cleanup), 0);
+    oxtest::write_file(oxtest::kLocalMap, file_for("zr", kLocal, "zr:  bo  =  bl2 more\nzr: ! bo\n"), 1000);
+    idm_test_on_secret_free(on_secret_free);
+    idm_buffer first{}, again{};
+    ASSERT_EQ(sec_idm_map_identity("zr", "alice", &first), 0);
+    const idm_translator *record = idm__native_find_translator("zr");
+    Blocks texts;
+    for (int32_t i = 0; i < record->entry_count; ++i)
+        for (const char *t : {record->entries[i].network_id, record->entries[i].local_id})
+            if (t != nullptr) texts.emplace_back(t, std::strlen(t) + 1);
+    ASSERT_EQ(texts.size(), 14u);
+    expect_routed({});
+    // The file changes: the next mapping releases every old identifier.
+    oxtest::set_mtime(oxtest::kLocalMap, 2000);
+    ASSERT_EQ(sec_idm_map_identity("zr", "alice", &again), 0);
+    expect_routed(texts);
+    texts = {{first.value, 3}, {again.value, 3}};  // results, released as the library releases a buffer
+    idm__release_buffer(&first);
+    idm__release_buffer(&again);
+    expect_routed(texts);
+    // A map file set: three paths, the names array and three per-file arrays.
+    idm_mapfile_set *set = nullptr;
+    ASSERT_EQ(idm__native_get_mapfile_names(&set), 0);
+    texts.clear();
+    for (int32_t i = 0; i < set->count; ++i) texts.emplace_back(set->names[i], std::strlen(set->names[i]) + 1);
+    idm__native_release_cachef(set);
+    expect_routed(texts, 4);
+    // A group lookup: the user buffer (twice the suggested size), the primary
+    // group's and the scan buffer, each zeroed whole.
+    const passwd *root = getpwuid(0);
+    const long pw = sysconf(_SC_GETPW_R_SIZE_MAX), gr = sysconf(_SC_GETGR_R_SIZE_MAX);
+    if (root == nullptr || pw <= 0 || gr <= 0) GTEST_SKIP() << "no user 0 or no suggested buffer sizes";
+    const std::string name = root->pw_name;
+    idm_buffer user{static_cast<uint32_t>(name.size() + 1), const_cast<char *>(name.c_str())};
+    uint32_t count = 0;
+    idm_buffer *groups = nullptr;
+    ASSERT_EQ(sec_idm_get_groups(&user, &count, &groups), 0);
+    idm_test_on_secret_free(nullptr);
+    for (uint32_t i = 0; i < count; ++i) std::free(groups[i].value);
+    std::free(groups);
+    std::multiset<size_t> sizes;
+    for (const auto &block : g_routed) sizes.insert(block.second);
+    EXPECT_EQ(sizes, (std::multiset<size_t>{size_t(2 * pw), size_t(gr), size_t(gr)}));
+    EXPECT_EQ(sweep::g_unzeroed.exchange(0), 0);
 }
 
 }  // namespace
