@@ -52,7 +52,7 @@ const char *const kScenarios[][2] = {
     {"a leaving writer wakes every reader when no writer waits", "Mw ArR BrR CrR MU A> B> C> =3,0 Au Bu Cu =0,0"},
     {"a leaving writer passes the lock to one waiting writer",
      "Mw AwW BwW CrR MU =-1,1 C. *U =-1,0 C. *U C> =1,0 Cu =0,0"},
-    {"two readers promote one after the other", "Ar> Br> ApW =1,1 Bp> =-1,1 A. BU A> =-1,0 AU =0,0"},
+    {"two readers promote one after the other, then a sole reader at once", "Ar> Br> ApW =1,1 Bp> =-1,1 A. BU A> =-1,0 AU =0,0 Cr> Cp> =-1,0 CU =0,0"},
     {"a cancelled promoter holds nothing and releases the readers", "Mr Ar> ApW BrR =1,1 Ac B> =2,0 Mu Bu =0,0"},
     {"a demoting writer waits behind both waiting writers",
      "Aw> BwW CwW AdR =-1,1 A. *U =-1,0 A. *U A> =1,0 Au =0,0"},
