@@ -125,6 +125,8 @@ TEST(NatmapRules, FailedApplicationReportsTheFirstFailingCheck) {
         {{"m", "r", {"a"}}, {"m", "r", {}, 1}, idm::kMsg665, {}},
         {{"m", "r", {"a", "b"}}, {"x", "r", {"a"}}, idm::kMsg664, {"2", "1"}},          // counts before types
         {{"m", "r", {"a"}}, {"M", "x", {"a"}}, idm::kMsg663, {}},                       // types before registries
+        {{"mech", "r", {"a"}}, {"mecx", "r", {"a"}}, idm::kMsg663, {}},                 // the whole type counts
+        {{"mech", "r", {"a"}}, {"mechs", "r", {"a"}}, idm::kMsg663, {}},
         {{"m", "r*m", {"x"}}, {"m", "rmx", {"a"}}, idm::kMsg667, {"r*m", "rmx"}},       // registry before tokens
         {{"m", "r", {"a", "b*", "c"}}, {"m", "r", {"a", "x", "y"}}, idm::kMsg666, {"b*", "x"}},
         {{"m", "r", {"a", "b"}}, {"m", "r", {"a", ""}}, idm::kMsg650, {}},  // the empty token, 2nd
