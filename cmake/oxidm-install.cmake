@@ -26,6 +26,7 @@ install(TARGETS ox_idm ox_cu ox_tr ox_mss EXPORT oxidmTargets
         INCLUDES DESTINATION ${OXIDM_INSTALL_INCLUDEDIR})
 install(FILES ${PROJECT_SOURCE_DIR}/include/oxidm.h ${PROJECT_SOURCE_DIR}/platform/cu/ox_cu.h
               ${PROJECT_SOURCE_DIR}/platform/tr/ox_tr.h ${PROJECT_SOURCE_DIR}/platform/mss/ox_mss.h
+              ${PROJECT_SOURCE_DIR}/mpm/oxmpm_plugin.h
         DESTINATION ${OXIDM_INSTALL_INCLUDEDIR} COMPONENT development)
 
 # Sample plug-ins (whichever mpm/ builds), the command and its private

@@ -1,19 +1,27 @@
 // Checkers for map files and the node information file.  The verdict on
-// every line or statement comes from the library's own pure judges; the
+// every line, rule or statement comes from the library's own judges; the
 // walk over the text copies the library's readers (pieces of at most 1023
 // characters for map files; one text with an appended LF for the node
 // information file), and the reasons and warnings are this module's words.
-#include "oxidm_check.h"
+// Time is linear in the text's size.
+#include "checker.h"
 
 #include <arpa/inet.h>
+#include <fmt/core.h>
 
 #include <algorithm>
+#include <climits>
 #include <cstdint>
+#include <cstring>
 #include <map>
 #include <string>
+#include <unordered_map>
+#include <unordered_set>
 
+#include "ox_cu.h"
 #include "oxidm_clmap.h"
 #include "oxidm_natfile.h"
+#include "oxidm_natmap.h"
 
 namespace oxidm_tool::check {
 
@@ -125,120 +133,235 @@ size_t MapfileReport::warnings() const { return count_of(*this, Severity::kWarni
 size_t NodeinfoReport::errors() const { return count_of(*this, Severity::kError); }
 size_t NodeinfoReport::warnings() const { return count_of(*this, Severity::kWarning); }
 
-bool wildcard_match(std::string_view pattern, std::string_view text) {
-    size_t star = pattern.find('*');
-    if (star == std::string_view::npos) return pattern == text;
-    std::string_view front = pattern.substr(0, star), back = pattern.substr(star + 1);
-    if (text.empty()) return false;
-    return text.size() >= front.size() + back.size() && text.substr(0, front.size()) == front &&
-           text.substr(text.size() - back.size()) == back;
-}
-
-bool field_covers(std::string_view outer, std::string_view inner) {
-    size_t star = outer.find('*');
-    if (star == std::string_view::npos) return inner == outer && inner.find('*') == std::string_view::npos;
-    size_t inner_star = inner.find('*');
-    if (inner_star == std::string_view::npos) return wildcard_match(outer, inner);
-    std::string_view f1 = outer.substr(0, star), s1 = outer.substr(star + 1);
-    std::string_view f2 = inner.substr(0, inner_star), s2 = inner.substr(inner_star + 1);
-    return f2.substr(0, std::min(f1.size(), f2.size())) == f1 && f2.size() >= f1.size() && s2.size() >= s1.size() &&
-           s2.substr(s2.size() - s1.size()) == s1;
-}
-
 // ---------------------------------------------------------------------------
 // Map files
 // ---------------------------------------------------------------------------
 
-void shadowing(const std::vector<MapEntry> &earlier, const std::string &earlier_file,
-               const std::vector<MapEntry> &later, const FieldSplitter &split, std::vector<Finding> &out) {
-    // One sequence in walk order: the earlier file's entries, then these.
-    std::vector<const MapEntry *> all;
-    for (const MapEntry &e : earlier) all.push_back(&e);
-    for (const MapEntry &e : later) all.push_back(&e);
-    size_t first_reported = earlier.size();
-    std::vector<std::vector<std::string>> fields(all.size());
-    std::vector<bool> exact(all.size());
-    for (size_t i = 0; i < all.size(); ++i) {
-        exact[i] = split && split(*all[i], fields[i]);
-        if (!exact[i]) fields[i] = {all[i]->network_id};
-    }
-    auto usable = [&](size_t i) {
-        for (const std::string &f : fields[i])
-            if (std::count(f.begin(), f.end(), '*') > 1) return false;
-        return true;
-    };
-    // An earlier entry covers a later one field by field.  Literal entries
-    // can only cover their equals, found through a map; the few entries
-    // with a wildcard are compared pairwise.
-    auto key_of = [&](size_t i) {
-        std::string k = all[i]->mechanism + '\0' + (exact[i] ? "1" : "0");
-        for (const std::string &f : fields[i]) k += '\0' + f;
-        return k;
-    };
-    auto literal = [&](size_t i) {
-        for (const std::string &f : fields[i])
-            if (f.find('*') != std::string::npos) return false;
-        return true;
-    };
-    std::map<std::string, size_t> first_literal;  // key -> earliest entry
-    std::vector<size_t> wildcards;                // usable entries with a '*', in order
-    for (size_t j = 0; j < all.size(); ++j) {
-        const MapEntry &d = *all[j];
-        if (!usable(j)) continue;
-        size_t found = SIZE_MAX;
-        bool is_literal = literal(j);
-        if (is_literal) {
-            auto it = first_literal.find(key_of(j));
-            if (it != first_literal.end()) found = it->second;
+namespace {
+
+// The library's current message on one line, without its origin.
+std::string reported() {
+    std::string out;
+    if (!cux_error_pending()) return out;
+    bool space = false;
+    for (const char *p = cux_error_text(); p && *p; ++p) {
+        if (*p == '\n' || *p == '\t' || *p == ' ') {
+            space = !out.empty();
+            continue;
         }
-        for (size_t i : wildcards) {
-            if (i >= found) break;
-            const MapEntry &e = *all[i];
-            if (e.mechanism != d.mechanism || exact[i] != exact[j] || fields[i].size() != fields[j].size()) continue;
-            bool covers = true;
-            for (size_t k = 0; k < fields[i].size() && covers; ++k) covers = field_covers(fields[i][k], fields[j][k]);
-            if (covers) {
-                found = i;
-                break;
-            }
-        }
-        if (is_literal) first_literal.emplace(key_of(j), j);
-        else wildcards.push_back(j);
-        if (found == SIZE_MAX || j < first_reported) continue;
-        const MapEntry &e = *all[found];
-        std::string earlier_line = (found < first_reported ? earlier_file + ":" + std::to_string(e.line)
-                                                           : "line " + std::to_string(e.line)) +
-                                   " (" +
-                                   (e.kind == EntryKind::kDenial ? "!" + show(e.network_id)
-                                                                 : show(e.network_id) + "=" + show(e.local_id)) +
-                                   ")";
-        if (d.kind == EntryKind::kDenial && e.kind == EntryKind::kAffirmative)
-            out.push_back({d.line, Severity::kWarning, "dead-denial",
-                           "this denial can never take effect: " + earlier_line +
-                               " matches every identity it names first"});
-        else if (d.kind == EntryKind::kDenial)
-            out.push_back({d.line, Severity::kNote, "redundant-denial", "already denied by " + earlier_line});
-        else
-            out.push_back({d.line, Severity::kNote, "shadowed-entry",
-                           "never used: " + earlier_line + " matches every identity it names first"});
+        if (space) out += ' ';
+        space = false;
+        out += *p;
     }
+    return out;
 }
 
-MapfileReport check_mapfile_text(std::string_view text, const std::string *mechanism,
-                                 const std::function<bool(const std::string &)> &is_uid0,
-                                 const FieldSplitter &split, const std::vector<std::string> *known) {
+// Has the mechanism's translator make the entry's rule, and the library
+// check it, as the mapping walk does.  Adds the verdict to `out`.
+void judge_rule(const Translator &t, MapEntry &e, std::vector<Finding> &out) {
+    std::string nid = e.network_id, local = e.local_id;
+    idm_mapfile_entry entry{};
+    entry.kind = e.kind == EntryKind::kDenial ? IDM_ENTRY_DENIAL : IDM_ENTRY_AFFIRMATIVE;
+    entry.network_id = nid.data();
+    entry.local_id = e.kind == EntryKind::kDenial ? nullptr : local.data();
+    idm_rule rule{};
+    idm_id id{};
+    cux_clear_error();
+    int32_t status = t.translate(&entry, nid.c_str(), &rule, &id);
+    bool owned = status == IDM_OK || status == IDM_TRANSLATOR_STOP || status == IDM_TRANSLATOR_REJECT ||
+                 status == IDM_TRANSLATOR_REFUSED;
+    if (status == IDM_TRANSLATOR_REFUSED || status == IDM_TRANSLATOR_STOP) {
+        out.push_back({e.line, Severity::kError, "refused-rule",
+                       fmt::format("the {} translator {} this line (status {}): the library never applies it",
+                                   e.mechanism, status == IDM_TRANSLATOR_STOP ? "stops the walk at" : "refuses",
+                                   status)});
+    } else if (!owned) {
+        out.push_back({e.line, Severity::kWarning, "translator-status",
+                       fmt::format("the {} translator answers status {} for this line: the library passes it over",
+                                   e.mechanism, status)});
+    } else if (rule.rgy_type == nullptr && rule.tokens == nullptr) {
+        out.push_back({e.line, Severity::kError, "refused-rule",
+                       fmt::format("the {} translator makes no rule of this line (status {})", e.mechanism, status)});
+    } else if (idm__native_check_rule(&rule) != 0) {
+        out.push_back({e.line, Severity::kError, "invalid-rule",
+                       "the library rejects this rule: " + reported()});
+    } else {
+        e.usable = true;
+        e.rgy_type = rule.rgy_type;
+        e.rgy = rule.rgy;
+        for (int32_t i = 0; i < rule.token_cnt; ++i) e.tokens.emplace_back(rule.tokens[i]);
+        if (rule.mapping != nullptr && rule.mapping->value != nullptr && std::strcmp(rule.mapping->value, "*") == 0)
+            e.name_token = static_cast<int32_t>(rule.rule_state >> 16);
+    }
+    if (owned) t.cleanup(&rule, &id);
+    cux_clear_error();
+}
+
+// Every identity `inner` can match is matched by `outer`: proved with the
+// library's matcher on inner's fields read as literal text (inner's '*' as
+// a character).  Sound for rules the library accepts (at most one '*' per
+// field): outer's text before and after its '*' holds no '*', so it lies
+// wholly before or after inner's.
+bool covers(const MapEntry &outer, const MapEntry &inner) {
+    if (outer.rgy_type != inner.rgy_type || outer.tokens.size() != inner.tokens.size()) return false;
+    if (!idm::wildcard_match(outer.rgy.c_str(), inner.rgy.c_str())) return false;
+    for (size_t i = 0; i < outer.tokens.size(); ++i)
+        if (!idm::wildcard_match(outer.tokens[i].c_str(), inner.tokens[i].c_str())) return false;
+    return true;
+}
+
+bool literal(const MapEntry &e) {
+    if (e.rgy.find('*') != std::string::npos) return false;
+    for (const std::string &t : e.tokens)
+        if (t.find('*') != std::string::npos) return false;
+    return true;
+}
+
+std::string key_of(const MapEntry &e) {
+    std::string k = e.mechanism + '\0' + e.rgy_type + '\0' + e.rgy;
+    for (const std::string &t : e.tokens) k += '\0' + t;
+    return k;
+}
+
+// Earlier usable entries, indexed so that the first one covering a later
+// entry is found in bounded time: equal literal rules through a hash, rules
+// with a wildcard (distinct ones only, per kind) compared one by one up to a
+// budget per question.  Past the budget a covering rule may be missed (one
+// is never claimed falsely); `truncated` counts such questions.
+class CoverIndex {
+  public:
+    static constexpr size_t kBudget = 64;
+
+    // The earliest entry (of `kind`, or of either kind when null) that covers `e`.
+    const MapEntry *first_cover(const MapEntry &e, const EntryKind *kind) {
+        Indexed best{nullptr, SIZE_MAX};
+        for (int k = 0; k < 2; ++k) {
+            if (kind && static_cast<int>(*kind) != k) continue;
+            if (literal(e))
+                if (auto it = literal_[k].find(key_of(e)); it != literal_[k].end() && it->second.order < best.order)
+                    best = it->second;
+            auto it = wild_[k].find(group_of(e));
+            if (it == wild_[k].end()) continue;
+            size_t tried = 0;
+            for (const Indexed &c : it->second) {
+                if (c.order > best.order) break;
+                if (++tried > kBudget) {
+                    ++truncated;
+                    break;
+                }
+                if (covers(*c.e, e)) {
+                    best = c;
+                    break;
+                }
+            }
+        }
+        return best.e;
+    }
+
+    void add(const MapEntry &e, size_t order) {
+        int k = static_cast<int>(e.kind);
+        if (literal(e)) literal_[k].emplace(key_of(e), Indexed{&e, order});  // the first one stays
+        else if (wild_keys_[k].insert(key_of(e)).second) wild_[k][group_of(e)].push_back({&e, order});
+    }
+
+    size_t truncated = 0;
+
+  private:
+    struct Indexed {
+        const MapEntry *e;
+        size_t order;
+    };
+    static std::string group_of(const MapEntry &e) {
+        return e.mechanism + '\0' + e.rgy_type + '\0' + std::to_string(e.tokens.size());
+    }
+    std::unordered_map<std::string, Indexed> literal_[2];
+    std::unordered_map<std::string, std::vector<Indexed>> wild_[2];
+    std::unordered_set<std::string> wild_keys_[2];
+};
+
+std::string describe_entry(const MapEntry &e, bool earlier_file, const std::string &file) {
+    return fmt::format("{} ({})", earlier_file ? fmt::format("{}:{}", file, e.line) : fmt::format("line {}", e.line),
+                       e.kind == EntryKind::kDenial ? "!" + show(e.network_id)
+                                                    : show(e.network_id) + "=" + show(e.local_id));
+}
+
+// Shadowed entries, and pass-through mappings that can yield a privileged
+// account, for the entries of this file after those of earlier files.
+void analyse(const MapContext &ctx, const std::vector<MapEntry> &entries, std::vector<Finding> &out) {
+    CoverIndex index;
+    std::unordered_set<const MapEntry *> from_earlier;
+    size_t order = 0;
+    if (ctx.earlier)
+        for (const MapEntry &e : *ctx.earlier)
+            if (e.usable) {
+                index.add(e, order++);
+                from_earlier.insert(&e);
+            }
+    const EntryKind denial = EntryKind::kDenial;
+    for (const MapEntry &d : entries) {
+        if (!d.usable) continue;
+        if (const MapEntry *e = index.first_cover(d, nullptr)) {
+            std::string by = describe_entry(*e, from_earlier.count(e) > 0, ctx.earlier_file);
+            if (d.kind == EntryKind::kDenial && e->kind == EntryKind::kAffirmative)
+                out.push_back({d.line, Severity::kWarning, "dead-denial",
+                               "this denial can never take effect: " + by + " matches every identity it names first"});
+            else if (d.kind == EntryKind::kDenial)
+                out.push_back({d.line, Severity::kNote, "redundant-denial", "already denied by " + by});
+            else
+                out.push_back({d.line, Severity::kNote, "shadowed-entry",
+                               "never used: " + by + " matches every identity it names first"});
+        } else if (d.name_token > 0 && static_cast<size_t>(d.name_token) <= d.tokens.size()) {
+            // A pass-through mapping: the identity's token becomes the local
+            // name.  Which privileged accounts can it yield that no earlier
+            // denial refuses first?
+            std::string uid0, other;
+            size_t others = 0;
+            MapEntry probe = d;
+            for (const Account &a : ctx.privileged) {
+                if (!idm::wildcard_match(d.tokens[static_cast<size_t>(d.name_token) - 1].c_str(), a.name.c_str()))
+                    continue;
+                probe.tokens[static_cast<size_t>(d.name_token) - 1] = a.name;
+                if (index.first_cover(probe, &denial) != nullptr) continue;
+                if (a.uid == 0) uid0 += (uid0.empty() ? "" : ", ") + a.name;
+                else if (others++ == 0) other = a.name;
+            }
+            // Names only of uid 0 and the lowest other account: the rest
+            // differ from system to system.
+            std::string yields = uid0.empty() ? "" : uid0 + " (uid 0)";
+            if (others > 0)
+                yields += fmt::format("{}{} below UID_MIN {}{}", yields.empty() ? "" : " and ",
+                                      others == 1 ? "the account" : "accounts", ctx.uid_min,
+                                      others == 1 ? " " + other : " such as " + other);
+            if (!yields.empty())
+                out.push_back({d.line, Severity::kWarning, "pass-through-privileged",
+                               "the mapping \"*\" passes the identity's name through and can yield " + yields +
+                                   ": no earlier denial refuses it"});
+        }
+        index.add(d, order++);
+    }
+    if (index.truncated > 0)
+        out.push_back({0, Severity::kNote, "cover-budget",
+                       fmt::format("{} entries were compared with the first {} distinct wildcard rules of their kind "
+                                   "only: an earlier rule that shadows them may go unmentioned",
+                                   index.truncated, CoverIndex::kBudget)});
+}
+
+}  // namespace
+
+MapfileReport check_mapfile_text(std::string_view text, const MapContext &ctx) {
     using idm::mapfile::LineKind;
     MapfileReport report;
+    const std::string *mechanism = ctx.mechanism;
+    const std::vector<std::string> *known = ctx.known;
     size_t pos = 0, line_no = 1;
     bool continuing = false;  // this piece continues the previous one's line
     while (pos < text.size()) {
         // One read: up to 1023 characters, or through the first line feed.
         size_t limit = std::min(text.size(), pos + kPieceMax);
-        size_t lf = text.find('\n', pos);
-        size_t end = (lf != std::string_view::npos && lf < limit) ? lf + 1 : limit;
+        size_t lf = text.substr(pos, limit - pos).find('\n');
+        size_t end = lf != std::string_view::npos ? pos + lf + 1 : limit;
         std::string_view piece = text.substr(pos, end - pos);
         pos = end;
-        ++report.pieces;
         bool ends_line = !piece.empty() && piece.back() == '\n';
         size_t this_line = line_no;
         if (!continuing && !ends_line && piece.size() == kPieceMax && pos < text.size())
@@ -252,8 +375,6 @@ MapfileReport check_mapfile_text(std::string_view text, const std::string *mecha
         if (seen.size() != piece.size() && piece.find_first_not_of(std::string_view("\0\n", 2)) != std::string_view::npos)
             report.findings.push_back({this_line, Severity::kWarning, "nul-byte",
                                        "holds a NUL byte: the library reads the line only up to it"});
-
-        // The mechanism this piece is judged for.
         std::string_view body = seen;
         if (size_t nl = body.find('\n'); nl != std::string_view::npos) body = body.substr(0, nl);
         size_t hash = body.find('#');
@@ -309,29 +430,36 @@ MapfileReport check_mapfile_text(std::string_view text, const std::string *mecha
                                        "invalid rule, ignored by the library: " + invalid_reason(body, comment_cut)});
             continue;
         }
-        MapEntry e{this_line, mech,
-                   v.kind == LineKind::kDenial ? EntryKind::kDenial : EntryKind::kAffirmative,
-                   std::string(v.network_id), std::string(v.local_id)};
+        MapEntry e;
+        e.line = this_line;
+        e.mechanism = mech;
+        e.kind = v.kind == LineKind::kDenial ? EntryKind::kDenial : EntryKind::kAffirmative;
+        e.network_id = v.network_id;
+        e.local_id = v.local_id;
         ignored_text(v, body, this_line, report.findings);
         std::string_view last = e.kind == EntryKind::kDenial ? std::string_view(e.network_id)
                                                              : std::string_view(e.local_id);
         if (!last.empty() && last.back() == '\r')
             report.findings.push_back({this_line, Severity::kWarning, "carriage-return",
                                        "ends in a carriage return, which becomes part of the identifier"});
+        const Translator *t = ctx.translator_for ? ctx.translator_for(mech) : nullptr;
+        if (t != nullptr) judge_rule(*t, e, report.findings);
+        else if (std::find(report.parsed_only.begin(), report.parsed_only.end(), mech) == report.parsed_only.end())
+            report.parsed_only.push_back(mech);
         report.entries.push_back(std::move(e));
     }
     report.lines = line_no - 1 + (continuing ? 1 : 0);
 
-    // Entries that grant a privileged account to a wildcard, and entries that
-    // an earlier entry of the same mechanism shadows.
+    // Entries that grant a uid-0 account to a wildcard identifier.
     for (const MapEntry &e : report.entries) {
-        if (e.kind == EntryKind::kAffirmative && e.network_id.find('*') != std::string::npos &&
-            (e.local_id == "root" || (is_uid0 && is_uid0(e.local_id))))
-            report.findings.push_back({e.line, Severity::kWarning, "wildcard-root",
-                                       "the wildcard identifier \"" + show(e.network_id) +
-                                           "\" maps to \"" + show(e.local_id) + "\", an account with uid 0"});
+        if (e.kind != EntryKind::kAffirmative || e.network_id.find('*') == std::string::npos) continue;
+        for (const Account &a : ctx.privileged)
+            if (a.uid == 0 && a.name == e.local_id)
+                report.findings.push_back({e.line, Severity::kWarning, "wildcard-root",
+                                           "the wildcard identifier \"" + show(e.network_id) + "\" maps to \"" +
+                                               show(e.local_id) + "\", an account with uid 0"});
     }
-    shadowing({}, "", report.entries, split, report.findings);
+    analyse(ctx, report.entries, report.findings);
     std::stable_sort(report.findings.begin(), report.findings.end(),
                      [](const Finding &a, const Finding &b) { return a.line < b.line; });
     return report;
@@ -365,6 +493,9 @@ struct Collector {
     std::map<std::pair<bool, std::string>, size_t> seen;  // key -> line first listed
     std::vector<Finding> *findings;
     size_t records = 0;
+    // The loader's bound on tree record bytes, and what the records so far
+    // cost (keys and cluster names as C strings: up to a NUL).
+    size_t budget = SIZE_MAX, spent = 0;
 
     static int32_t on_value(void *c, idm::clmap::Attr attr, std::string_view v) {
         auto *self = static_cast<Collector *>(c);
@@ -373,8 +504,21 @@ struct Collector {
     }
     static int32_t on_record(void *c) {
         auto *self = static_cast<Collector *>(c);
-        self->store();
-        return 0;
+        return self->within_budget() ? (self->store(), 0) : kOverBudget;
+    }
+    static constexpr int32_t kOverBudget = 6;  // the loader's status: no memory (2650-654)
+    static size_t c_length(std::string_view v) { return std::min(v.size(), v.find('\0')); }
+
+    bool within_budget() {
+        size_t cluster_bytes = 0;
+        for (std::string_view c : values[idm::clmap::kClusters]) cluster_bytes += sizeof(char *) + c_length(c) + 1;
+        for (int a = idm::clmap::kNames; a <= idm::clmap::kAddresses; ++a)
+            for (std::string_view v : values[a]) {
+                size_t need = sizeof(idm_clnode) + c_length(v) + 1 + cluster_bytes;
+                if (need > budget - spent) return false;
+                spent += need;
+            }
+        return true;
     }
     size_t line_of(std::string_view v) const { return index->line_of(static_cast<size_t>(v.data() - text.data())); }
 
@@ -490,12 +634,27 @@ NodeinfoReport check_nodeinfo_text(std::string_view raw) {
                    (!raw.empty() && raw.back() != '\n' ? 1 : 0);
     std::vector<Finding> warnings;
 
+    for (size_t at = raw.find('\0'); at != std::string_view::npos; at = raw.find('\0', raw.find('\n', at)))
+        warnings.push_back({index.line_of(at), Severity::kWarning, "nul-byte",
+                            "holds a NUL byte: the library keeps names as C strings, so a value holding it is cut "
+                            "there"});
+
     Collector first{text, &index, true, {}, {}, {}, &warnings, 0};
+    first.budget = text.size() * idm::clmap::kRecordBytesPerTextByte + idm::clmap::kRecordBytesAllowance;
     idm::clmap::ParseSink sink{&first, &Collector::on_value, &Collector::on_record};
     idm::clmap::ParseResult r = idm::clmap::parse(text, sink);
     report.records = first.records;
     if (r.status == 0) {
         report.hosts = std::move(first.hosts);
+    } else if (r.status == Collector::kOverBudget) {
+        report.loads = false;
+        report.first_error_line = r.line;
+        report.findings.push_back(
+            {r.line, Severity::kError, "memory-bound",
+             fmt::format("the host record ending here takes the file's tree records past the library's bound "
+                         "({} bytes for this file: a copy of the cluster list per name and address): the library "
+                         "loads nothing (2650-654)",
+                         first.budget)});
     } else {
         report.loads = false;
         report.first_error_line = r.line;

@@ -2,17 +2,17 @@
 // (oxidm_tracepoints.h): routine, meaning and item names of every id; 8-byte
 // items are addresses unless their name starts with '#' (then a count or a
 // time).
-#include "oxidm_tracefmt.h"
+#include "tracefmt.h"
 
 #include <algorithm>
 #include <cctype>
 #include <cstring>
 #include <deque>
+#include <functional>
 #include <string_view>
 
 #include "ox_tr.h"
 #include "oxidm_tracepoints.h"
-#include "oxidm_json.h"
 
 namespace oxidm_tool {
 
@@ -44,7 +44,7 @@ bool is_address_name(const char *name) {
     return name[0] != '#';
 }
 
-std::string quoted(std::string_view s) {
+std::string quoted_text(std::string_view s) {
     std::string out = "\"";
     for (unsigned char c : s) {
         if (c == '"' || c == '\\') {
@@ -121,6 +121,29 @@ std::string TraceRecord::text(size_t j) const {
 
 size_t captured_count() { return trx_count(); }
 
+namespace {
+std::function<void(const TraceRecord &)> g_sink;
+bool g_forget = true;
+size_t g_delivered = 0;
+void drain_hook(int) { drain_records(); }
+}  // namespace
+
+void stream_records(std::function<void(const TraceRecord &)> sink, bool forget) {
+    g_sink = std::move(sink);
+    g_forget = forget;
+    if (forget) trx_clear();
+    g_delivered = trx_count();
+    trx_on_record(g_sink ? drain_hook : nullptr);
+}
+
+void drain_records() {
+    if (!g_sink) return;
+    std::vector<TraceRecord> records = captured_records(g_delivered);
+    if (g_forget) trx_clear();
+    g_delivered = g_forget ? 0 : g_delivered + records.size();
+    for (const TraceRecord &r : records) g_sink(r);
+}
+
 std::vector<TraceRecord> captured_records(size_t from) {
     std::vector<TraceRecord> out;
     size_t n = trx_count();
@@ -185,7 +208,7 @@ std::string decode_item(const TraceRecord &r, size_t j) {
     const TraceIdInfo *info = trace_id_info(r.id);
     const std::string &s = r.items[j];
     const char *raw_name = info && j < 8 ? info->items[j] : nullptr;
-    if (r.is_text(j)) return quoted(r.text(j));
+    if (r.is_text(j)) return quoted_text(r.text(j));
     if (s.size() == 4) return std::to_string(r.i32(j));
     if (s.size() == 8) {
         if (!is_address_name(raw_name)) return std::to_string(r.i64(j));
@@ -228,35 +251,25 @@ std::string format_record(const TraceRecord &r) {
     return out;
 }
 
-void records_json(const std::vector<TraceRecord> &records, Json &json) {
-    json.begin_array("records");
+nlohmann::ordered_json records_json(const std::vector<TraceRecord> &records) {
+    nlohmann::ordered_json out = nlohmann::ordered_json::array();
     for (const TraceRecord &r : records) {
         const TraceIdInfo *info = trace_id_info(r.id);
-        json.begin_object();
-        json.str("component", r.component);
-        json.num("id", r.id);
-        json.opt("routine", info ? info->routine : nullptr);
-        json.opt("what", info ? info->what : nullptr);
-        json.begin_array("items");
+        auto opt = [](const char *t) { return t ? nlohmann::ordered_json(t) : nlohmann::ordered_json(); };
+        nlohmann::ordered_json items = nlohmann::ordered_json::array();
         for (size_t j = 0; j < r.items.size(); ++j) {
-            json.begin_object();
-            json.opt("name", item_name(info, j));
+            nlohmann::ordered_json item{{"name", opt(item_name(info, j))}};
             const std::string &s = r.items[j];
-            if (r.is_text(j)) {
-                json.str("text", r.text(j));
-            } else if (s.size() == 4) {
-                json.num("int", r.i32(j));
-            } else if (s.size() == 8 && !is_address_name(info && j < 8 ? info->items[j] : nullptr)) {
-                json.num("int", r.i64(j));
-            } else {
-                json.str("raw", decode_item(r, j));
-            }
-            json.end_object();
+            if (r.is_text(j)) item["text"] = r.text(j);
+            else if (s.size() == 4) item["int"] = r.i32(j);
+            else if (s.size() == 8 && !is_address_name(info && j < 8 ? info->items[j] : nullptr)) item["int"] = r.i64(j);
+            else item["raw"] = decode_item(r, j);
+            items.push_back(std::move(item));
         }
-        json.end_array();
-        json.end_object();
+        out.push_back({{"component", r.component}, {"id", r.id}, {"routine", opt(info ? info->routine : nullptr)},
+                       {"what", opt(info ? info->what : nullptr)}, {"items", std::move(items)}});
     }
-    json.end_array();
+    return out;
 }
 
 // The stand-in writes: COMPONENT ID then items, each " \"text\"" (no

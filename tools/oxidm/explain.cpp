@@ -1,0 +1,345 @@
+// oxidm explain MECH IDENTITY: maps as `map` does and shows how the library
+// got there.  The parser's Diag records (file state, file, line as read,
+// invalid line, new entry) give each entry its file and line; the records
+// written between two translator calls belong to one entry (the check of
+// its rule and of the id, the application and its result).  Records are
+// consumed as they are written, so any number of lines is explained.
+#include <fmt/core.h>
+
+#include "oxidm_tracepoints.h"
+#include "watch.h"
+
+namespace oxidm_tool {
+
+namespace {
+
+namespace tp = idm::trace::tp;
+
+struct Line {
+    std::string file;
+    size_t number = 0;
+    std::string text;  // as read, without its line feed
+    bool invalid = false;
+    bool denial = false;
+    std::string network_id, local_id;
+};
+
+// What the records between two translator calls say about one entry.
+struct Verdict {
+    TranslatorCall call;
+    int check_rule = -1, check_id = -1, apply = -1;  // statuses, -1 when not run
+    bool matched = false;
+    std::string result;              // local identity from the match, "" for none
+    std::string rule_text, id_text;  // from the rule and id dumps
+    int msgno = 0;
+    std::string message;  // reported while this entry was handled
+};
+
+// Builds the explanation from the records as they come.
+struct Explanation {
+    Json files = Json::array();
+    std::vector<Line> lines;         // invalid lines and entries, in file order
+    std::vector<size_t> entry_line;  // entry index -> index into lines
+    std::vector<Verdict> verdicts;   // one per translator call
+
+    // Parse position.
+    std::string file;
+    size_t next_number = 1;
+    Line current;
+    // Dump being read.
+    enum { kNone, kRule, kId } dumping = kNone;
+    std::string rgy_type, rgy, mapping;
+    bool has_mapping = false;
+    std::vector<std::string> tokens;
+
+    void finish_dump() {
+        if (dumping != kNone && !verdicts.empty()) {
+            std::string s = fmt::format("type \"{}\", registry \"{}\", tokens (", rgy_type, rgy);
+            for (size_t i = 0; i < tokens.size(); ++i) s += fmt::format("{}\"{}\"", i ? ", " : "", tokens[i]);
+            s += ")";
+            if (dumping == kRule)
+                verdicts.back().rule_text = s + (has_mapping ? ", grants \"" + mapping + "\"" : ", grants nothing");
+            else
+                verdicts.back().id_text = s;
+        }
+        dumping = kNone;
+        tokens.clear();
+        has_mapping = false;
+    }
+
+    void parse_record(const TraceRecord &r) {
+        switch (r.id) {
+            case tp::kTestFilesState:
+                if (r.items.size() >= 4) {
+                    Json f{{"path", r.text(1)}, {"present", r.i32(2) != 0}, {"read", r.i32(3) != 0}};
+                    for (Json &known : files)
+                        if (known["path"] == f["path"]) {
+                            known = f;
+                            return;
+                        }
+                    files.push_back(std::move(f));
+                }
+                break;
+            case tp::kParseFile:
+                file = r.text(0);
+                next_number = 1;
+                break;
+            case tp::kParseLine: {
+                // A piece of at most 1023 characters; a line goes on while
+                // its pieces end without a line feed.
+                std::string t = r.text(0);
+                bool ends_line = (!t.empty() && t.back() == '\n') || t.size() < 1023;
+                if (!t.empty() && t.back() == '\n') t.pop_back();
+                current = Line{};
+                current.file = file;
+                current.number = next_number;
+                current.text = t;
+                if (ends_line) ++next_number;
+                break;
+            }
+            case tp::kEntriesInvalidLine:
+                lines.push_back(current);
+                lines.back().invalid = true;
+                break;
+            case tp::kEntriesNewEntry:
+                entry_line.push_back(lines.size());
+                lines.push_back(current);
+                lines.back().denial = r.text(1).rfind("Denial", 0) == 0;
+                lines.back().network_id = r.text(2);
+                lines.back().local_id = r.text(3);
+                break;
+            default:
+                break;
+        }
+    }
+
+    void walk_record(const TraceRecord &r) {
+        if (verdicts.empty()) return;
+        Verdict &v = verdicts.back();
+        switch (r.id) {
+            case tp::kDumpRule:
+                finish_dump();
+                dumping = kRule;
+                rgy_type = r.text(1);
+                rgy = r.text(2);
+                break;
+            case tp::kDumpId:
+                finish_dump();
+                dumping = kId;
+                rgy_type = r.text(0);
+                rgy = r.text(1);
+                break;
+            case tp::kDumpToken:
+                if (dumping != kNone) tokens.push_back(r.text(1));
+                break;
+            case tp::kDumpRuleMapping:
+                has_mapping = true;
+                mapping = r.text(1);
+                break;
+            case tp::kCheckRuleExitData:
+                finish_dump();
+                v.check_rule = r.i32(0);
+                break;
+            case tp::kCheckIdExitData:
+                finish_dump();
+                v.check_id = r.i32(0);
+                break;
+            case tp::kApplyMatched:
+                v.matched = true;
+                break;
+            case tp::kApplyResult: {
+                v.matched = true;
+                std::string value = r.text(0);
+                v.result = value == "[null]" ? "" : value;
+                break;
+            }
+            case tp::kApplyExitData:
+                finish_dump();
+                v.apply = r.i32(0);
+                if (v.apply == 0) v.matched = true;
+                break;
+            default:
+                break;
+        }
+    }
+
+    void call_start(const TranslatorCall &c) {
+        finish_dump();
+        if (!verdicts.empty()) {
+            verdicts.back().msgno = c.msgno_before;
+            verdicts.back().message = c.message_before;
+        }
+        verdicts.emplace_back();
+        verdicts.back().call = c;
+    }
+};
+
+std::string describe(const Verdict &v, bool denial) {
+    auto with_message = [&](const std::string &what) {
+        return v.message.empty() ? what : what + ": " + short_message(v.message);
+    };
+    switch (v.call.status) {
+        case IDM_OK: break;
+        case IDM_TRANSLATOR_STOP: return with_message("the translator stopped the walk (status 31)");
+        case IDM_TRANSLATOR_REJECT: return with_message("the translator rejected the identity or the line (status 38)");
+        case IDM_TRANSLATOR_REFUSED:
+            return with_message("the translator refused the line (status 39): not tried again until the map "
+                                "files change");
+        default:
+            return fmt::format("the translator answered status {}: the line is passed over this time", v.call.status);
+    }
+    if (v.matched) return denial ? "matches: a denial, no local identity granted" : "matches: maps to \"" + v.result + "\"";
+    if (v.check_rule > 0) return with_message("invalid rule");
+    if (v.check_id > 0) return with_message("invalid id");
+    if (v.apply > 0) return with_message("no match");
+    if (v.apply < 0) return "passed over: its rule was found unusable before";
+    return "no match";
+}
+
+struct ExplainArgs {
+    std::string mechanism, identity;
+};
+
+Result run_explain(const Options &o, const ExplainArgs &a) {
+    Result r;
+    r.json["mechanism"] = a.mechanism;
+    r.json["identity"] = a.identity;
+    if (std::string e = unreadable_config({kLocalMap, kVarGlobalMap, kOptGlobalMap}); !e.empty()) {
+        r.fail("explain", e);
+        return r;
+    }
+    if (std::string e = register_watched(a.mechanism); !e.empty()) {
+        r.fail("explain", e);
+        return r;
+    }
+    Explanation x;
+    Watch w;
+    w.on_record = [&x](const TraceRecord &t) {
+        x.parse_record(t);
+        x.walk_record(t);
+    };
+    w.on_call_start = [&x](const TranslatorCall &c) { x.call_start(c); };
+    w.on_call_end = [&x](const TranslatorCall &c) { x.verdicts.back().call.status = c.status; };
+    MapOutcome m = map_watched(o, a.mechanism, a.identity, true, std::move(w));
+    x.finish_dump();
+    if (!x.verdicts.empty()) {
+        x.verdicts.back().msgno = m.msgno_after;
+        x.verdicts.back().message = m.message_after;
+    }
+    // In a fresh process translator call k of the walk is entry k (no rule
+    // is cached yet); the entries' texts must agree for that to hold.
+    bool aligned = x.verdicts.size() <= x.entry_line.size();
+    for (size_t k = 0; aligned && k < x.verdicts.size(); ++k) {
+        const Line &l = x.lines[x.entry_line[k]];
+        const TranslatorCall &c = x.verdicts[k].call;
+        aligned = c.has_entry && l.network_id == c.network_id && (l.denial || l.local_id == c.local_id);
+    }
+    long decided = m.status == 0 && !x.verdicts.empty() && x.verdicts.back().matched
+                       ? static_cast<long>(x.verdicts.size()) - 1
+                       : -1;
+    if (m.granted) r.exit = kExitAnswer;
+    else if (m.status == 0) r.exit = kExitNoAnswer;
+    else r.fail("explain " + a.identity, m.error);
+
+    r.json["status"] = m.status;
+    r.json["granted"] = m.granted;
+    r.json["local"] = m.granted ? Json(m.local) : Json();
+    r.json["answer"] = m.granted        ? "maps to \"" + m.local + "\""
+                       : m.status == 0 ? (decided >= 0 ? "no local identity granted (a denial matched)"
+                                                       : "no local identity granted (no line matched)")
+                                       : "error: " + m.error;
+    if (!m.error.empty()) r.json["error"] = m.error;
+    r.json["files"] = std::move(x.files);
+    Json lines = Json::array();
+    size_t entry = 0;
+    for (const Line &l : x.lines) {
+        Json one{{"file", l.file}, {"line", l.number}, {"text", l.text}};
+        if (l.invalid) {
+            one["verdict"] = "ignored";
+            one["reason"] = "invalid rule (the parser ignores the line)";
+            lines.push_back(std::move(one));
+            continue;
+        }
+        size_t k = entry++;
+        one["kind"] = l.denial ? "denial" : "affirmative";
+        one["network_id"] = l.network_id;
+        one["local_id"] = l.denial ? Json() : Json(l.local_id);
+        if (!aligned || k >= x.verdicts.size()) {
+            one["verdict"] = aligned ? "not reached" : "unknown";
+            one["detail"] = aligned ? "not reached: the walk ended before this line" : "(not matched with the walk)";
+        } else {
+            const Verdict &v = x.verdicts[k];
+            one["verdict"] = v.matched ? "match" : "no match";
+            one["detail"] = describe(v, l.denial);
+            one["translator_status"] = v.call.status;
+            if (v.check_rule >= 0) one["check_rule"] = v.check_rule;
+            if (v.check_id >= 0) one["check_id"] = v.check_id;
+            if (v.apply >= 0) one["apply"] = v.apply;
+            if (v.msgno != 0) {
+                one["message_number"] = v.msgno;
+                one["message"] = v.message;
+            }
+            if (!v.rule_text.empty()) one["rule"] = v.rule_text;
+            if (!v.id_text.empty()) one["id"] = v.id_text;
+            one["decided"] = static_cast<long>(k) == decided;
+        }
+        lines.push_back(std::move(one));
+    }
+    r.json["lines"] = std::move(lines);
+    if (decided >= 0 && aligned) {
+        const Line &l = x.lines[x.entry_line[static_cast<size_t>(decided)]];
+        r.json["decided_by"] = {{"file", l.file}, {"line", l.number}, {"text", l.text}};
+    } else {
+        r.json["decided_by"] = nullptr;
+    }
+    return r;
+}
+
+void text_explain(const Json &j) {
+    fmt::print("explain {} {}\n", j["mechanism"].get<std::string>(), j["identity"].get<std::string>());
+    if (!j.contains("lines")) return;
+    for (const Json &f : j["files"])
+        fmt::print("  file {:<34} {}\n", f["path"].get<std::string>(),
+                   !f["present"].get<bool>() ? "absent" : f["read"].get<bool>() ? "selected" : "present, not used (superseded)");
+    if (j["files"].empty()) fmt::print("  (the map files were not read in this call)\n");
+    for (const Json &l : j["lines"]) {
+        std::string where = fmt::format("{}:{}", l["file"].get<std::string>(), l["line"].get<size_t>());
+        std::string text = printable(l["text"]);
+        if (l["verdict"] == "ignored") {
+            fmt::print("  {}: {}\n      ignored by the parser: invalid rule\n", where, text);
+            continue;
+        }
+        bool decides = l.value("decided", false);
+        fmt::print("  {}: {}\n      {}{}\n", where, text, printable(l["detail"]), decides ? "   <== decides" : "");
+        if (l["verdict"] == "no match") {
+            if (l.contains("rule")) fmt::print("      rule: {}\n", printable(l["rule"]));
+            if (l.contains("id")) fmt::print("      id:   {}\n", printable(l["id"]));
+        }
+    }
+    std::string answer = j["answer"];
+    if (!j["decided_by"].is_null())
+        fmt::print("answer: {}, decided by {}:{}\n", answer, j["decided_by"]["file"].get<std::string>(),
+                   j["decided_by"]["line"].get<size_t>());
+    else if (j["status"] == 0 && j["lines"].empty())
+        fmt::print("answer: {}: the map files hold no line of {}\n", answer, j["mechanism"].get<std::string>());
+    else
+        fmt::print("answer: {}\n", answer);
+}
+
+}  // namespace
+
+void add_explain(CLI::App &app, Options &o, CommandList &out) {
+    auto a = std::make_shared<ExplainArgs>();
+    CLI::App *sub = app.add_subcommand("explain", "which map file line decided, and why earlier lines did not");
+    sub->footer(
+        "Maps IDENTITY as `oxidm map` does and shows how the library got there: which map files it read,\n"
+        "every line of MECH in the order it tried them, why each line before the deciding one did not match\n"
+        "(the library's own message), and the file and line that decided.  Lines the parser ignored as\n"
+        "invalid are shown too.  The source is the library's trace (API level 8, Mapping 8, Diag 1).\n\n"
+        "Exit status: as for map.");
+    sub->add_option("MECH", a->mechanism, "the mechanism's mnemonic")->required();
+    sub->add_option("IDENTITY", a->identity, "one network identity")->required();
+    out.push_back({sub, [&o, a] { return run_explain(o, *a); }, text_explain});
+}
+
+}  // namespace oxidm_tool
