@@ -15,22 +15,22 @@ namespace {
 
 namespace tp = idm::trace::tp;
 
+// One line the parser reported: an invalid line or an entry.  Kept small:
+// a file of millions of lines is explained whole.
 struct Line {
-    std::string file;
+    uint32_t file = 0;  // index into Explanation::file_names
+    bool invalid = false, denial = false;
     size_t number = 0;
     std::string text;  // as read, without its line feed
-    bool invalid = false;
-    bool denial = false;
-    std::string network_id, local_id;
 };
 
 // What the records between two translator calls say about one entry.
 struct Verdict {
-    TranslatorCall call;
+    int32_t status = 0;                              // the translator's
     int check_rule = -1, check_id = -1, apply = -1;  // statuses, -1 when not run
     bool matched = false;
-    std::string result;              // local identity from the match, "" for none
-    std::string rule_text, id_text;  // from the rule and id dumps
+    std::string result;     // local identity from the match, "" for none
+    std::string rule_text;  // from the rule dump
     int msgno = 0;
     std::string message;  // reported while this entry was handled
 };
@@ -38,12 +38,15 @@ struct Verdict {
 // Builds the explanation from the records as they come.
 struct Explanation {
     Json files = Json::array();
+    std::vector<std::string> file_names;
     std::vector<Line> lines;         // invalid lines and entries, in file order
     std::vector<size_t> entry_line;  // entry index -> index into lines
+    std::vector<std::string> entry_id;  // entry index -> network id, until its call is seen
     std::vector<Verdict> verdicts;   // one per translator call
+    bool aligned = true;             // call k of the walk is entry k
+    std::string id_text;             // the identity as the translator made it
 
     // Parse position.
-    std::string file;
     size_t next_number = 1;
     Line current;
     // Dump being read.
@@ -59,8 +62,8 @@ struct Explanation {
             s += ")";
             if (dumping == kRule)
                 verdicts.back().rule_text = s + (has_mapping ? ", grants \"" + mapping + "\"" : ", grants nothing");
-            else
-                verdicts.back().id_text = s;
+            else if (id_text.empty())
+                id_text = s;
         }
         dumping = kNone;
         tokens.clear();
@@ -81,7 +84,7 @@ struct Explanation {
                 }
                 break;
             case tp::kParseFile:
-                file = r.text(0);
+                file_names.push_back(r.text(0));
                 next_number = 1;
                 break;
             case tp::kParseLine: {
@@ -91,9 +94,9 @@ struct Explanation {
                 bool ends_line = (!t.empty() && t.back() == '\n') || t.size() < 1023;
                 if (!t.empty() && t.back() == '\n') t.pop_back();
                 current = Line{};
-                current.file = file;
+                current.file = file_names.empty() ? 0 : static_cast<uint32_t>(file_names.size() - 1);
                 current.number = next_number;
-                current.text = t;
+                current.text = std::move(t);
                 if (ends_line) ++next_number;
                 break;
             }
@@ -103,10 +106,9 @@ struct Explanation {
                 break;
             case tp::kEntriesNewEntry:
                 entry_line.push_back(lines.size());
+                entry_id.push_back(r.text(2));
                 lines.push_back(current);
                 lines.back().denial = r.text(1).rfind("Denial", 0) == 0;
-                lines.back().network_id = r.text(2);
-                lines.back().local_id = r.text(3);
                 break;
             default:
                 break;
@@ -169,8 +171,12 @@ struct Explanation {
             verdicts.back().msgno = c.msgno_before;
             verdicts.back().message = c.message_before;
         }
+        // In a fresh process translator call k of the walk is entry k (no
+        // rule is cached yet); the entries' identifiers must agree.
+        size_t k = verdicts.size();
+        aligned = aligned && c.has_entry && k < entry_id.size() && entry_id[k] == c.network_id;
+        if (k < entry_id.size()) std::string().swap(entry_id[k]);
         verdicts.emplace_back();
-        verdicts.back().call = c;
     }
 };
 
@@ -178,7 +184,7 @@ std::string describe(const Verdict &v, bool denial) {
     auto with_message = [&](const std::string &what) {
         return v.message.empty() ? what : what + ": " + short_message(v.message);
     };
-    switch (v.call.status) {
+    switch (v.status) {
         case IDM_OK: break;
         case IDM_TRANSLATOR_STOP: return with_message("the translator stopped the walk (status 31)");
         case IDM_TRANSLATOR_REJECT: return with_message("the translator rejected the identity or the line (status 38)");
@@ -186,7 +192,7 @@ std::string describe(const Verdict &v, bool denial) {
             return with_message("the translator refused the line (status 39): not tried again until the map "
                                 "files change");
         default:
-            return fmt::format("the translator answered status {}: the line is passed over this time", v.call.status);
+            return fmt::format("the translator answered status {}: the line is passed over this time", v.status);
     }
     if (v.matched) return denial ? "matches: a denial, no local identity granted" : "matches: maps to \"" + v.result + "\"";
     if (v.check_rule > 0) return with_message("invalid rule");
@@ -198,9 +204,56 @@ std::string describe(const Verdict &v, bool denial) {
 
 struct ExplainArgs {
     std::string mechanism, identity;
+    Explanation x;     // the result's lines, rendered one at a time
+    long decided = -1;  // entry that ended the walk with a match
 };
 
-Result run_explain(const Options &o, const ExplainArgs &a) {
+bool explain_wants(int id) {
+    switch (id) {
+        case tp::kTestFilesState: case tp::kParseFile: case tp::kParseLine: case tp::kEntriesInvalidLine:
+        case tp::kEntriesNewEntry: case tp::kDumpRule: case tp::kDumpId: case tp::kDumpToken:
+        case tp::kDumpRuleMapping: case tp::kCheckRuleExitData: case tp::kCheckIdExitData: case tp::kApplyMatched:
+        case tp::kApplyResult: case tp::kApplyExitData:
+            return true;
+        default:
+            return false;
+    }
+}
+
+// Line `i` of the explanation as JSON.
+Json line_json(const ExplainArgs &a, size_t i, size_t entry) {
+    const Explanation &x = a.x;
+    const Line &l = x.lines[i];
+    Json one{{"file", x.file_names.empty() ? "" : x.file_names[l.file]}, {"line", l.number}, {"text", l.text}};
+    if (l.invalid) {
+        one["verdict"] = "ignored";
+        one["detail"] = "invalid rule (the parser ignores the line)";
+        return one;
+    }
+    one["kind"] = l.denial ? "denial" : "affirmative";
+    if (!x.aligned || entry >= x.verdicts.size()) {
+        one["verdict"] = x.aligned ? "not reached" : "unknown";
+        one["detail"] = x.aligned ? "not reached: the walk ended before this line" : "(not matched with the walk)";
+        return one;
+    }
+    const Verdict &v = x.verdicts[entry];
+    one["verdict"] = v.matched ? "match" : "no match";
+    one["detail"] = describe(v, l.denial);
+    one["translator_status"] = v.status;
+    if (v.apply >= 0) one["apply"] = v.apply;
+    if (v.msgno != 0) one["message_number"] = v.msgno;
+    if (!v.rule_text.empty()) one["rule"] = v.rule_text;
+    one["decided"] = static_cast<long>(entry) == a.decided;
+    return one;
+}
+
+// Hands every line to `sink` in file order.
+void each_line(const ExplainArgs &a, const std::function<void(const Json &)> &sink) {
+    size_t entry = 0;
+    for (size_t i = 0; i < a.x.lines.size(); ++i) sink(line_json(a, i, a.x.lines[i].invalid ? 0 : entry++));
+}
+
+Result run_explain(const Options &o, ExplainArgs &a) {
     Result r;
     r.json["mechanism"] = a.mechanism;
     r.json["identity"] = a.identity;
@@ -212,31 +265,25 @@ Result run_explain(const Options &o, const ExplainArgs &a) {
         r.fail("explain", e);
         return r;
     }
-    Explanation x;
+    Explanation &x = a.x;
     Watch w;
+    w.wants = explain_wants;
     w.on_record = [&x](const TraceRecord &t) {
         x.parse_record(t);
         x.walk_record(t);
     };
     w.on_call_start = [&x](const TranslatorCall &c) { x.call_start(c); };
-    w.on_call_end = [&x](const TranslatorCall &c) { x.verdicts.back().call.status = c.status; };
+    w.on_call_end = [&x](const TranslatorCall &c) { x.verdicts.back().status = c.status; };
     MapOutcome m = map_watched(o, a.mechanism, a.identity, true, std::move(w));
     x.finish_dump();
     if (!x.verdicts.empty()) {
         x.verdicts.back().msgno = m.msgno_after;
         x.verdicts.back().message = m.message_after;
     }
-    // In a fresh process translator call k of the walk is entry k (no rule
-    // is cached yet); the entries' texts must agree for that to hold.
-    bool aligned = x.verdicts.size() <= x.entry_line.size();
-    for (size_t k = 0; aligned && k < x.verdicts.size(); ++k) {
-        const Line &l = x.lines[x.entry_line[k]];
-        const TranslatorCall &c = x.verdicts[k].call;
-        aligned = c.has_entry && l.network_id == c.network_id && (l.denial || l.local_id == c.local_id);
-    }
-    long decided = m.status == 0 && !x.verdicts.empty() && x.verdicts.back().matched
-                       ? static_cast<long>(x.verdicts.size()) - 1
-                       : -1;
+    x.aligned = x.aligned && x.verdicts.size() <= x.entry_line.size();
+    a.decided = m.status == 0 && !x.verdicts.empty() && x.verdicts.back().matched
+                    ? static_cast<long>(x.verdicts.size()) - 1
+                    : -1;
     if (m.granted) r.exit = kExitAnswer;
     else if (m.status == 0) r.exit = kExitNoAnswer;
     else r.fail("explain " + a.identity, m.error);
@@ -245,82 +292,49 @@ Result run_explain(const Options &o, const ExplainArgs &a) {
     r.json["granted"] = m.granted;
     r.json["local"] = m.granted ? Json(m.local) : Json();
     r.json["answer"] = m.granted        ? "maps to \"" + m.local + "\""
-                       : m.status == 0 ? (decided >= 0 ? "no local identity granted (a denial matched)"
-                                                       : "no local identity granted (no line matched)")
+                       : m.status == 0 ? (a.decided >= 0 ? "no local identity granted (a denial matched)"
+                                                         : "no local identity granted (no line matched)")
                                        : "error: " + m.error;
     if (!m.error.empty()) r.json["error"] = m.error;
-    r.json["files"] = std::move(x.files);
-    Json lines = Json::array();
-    size_t entry = 0;
-    for (const Line &l : x.lines) {
-        Json one{{"file", l.file}, {"line", l.number}, {"text", l.text}};
-        if (l.invalid) {
-            one["verdict"] = "ignored";
-            one["reason"] = "invalid rule (the parser ignores the line)";
-            lines.push_back(std::move(one));
-            continue;
-        }
-        size_t k = entry++;
-        one["kind"] = l.denial ? "denial" : "affirmative";
-        one["network_id"] = l.network_id;
-        one["local_id"] = l.denial ? Json() : Json(l.local_id);
-        if (!aligned || k >= x.verdicts.size()) {
-            one["verdict"] = aligned ? "not reached" : "unknown";
-            one["detail"] = aligned ? "not reached: the walk ended before this line" : "(not matched with the walk)";
-        } else {
-            const Verdict &v = x.verdicts[k];
-            one["verdict"] = v.matched ? "match" : "no match";
-            one["detail"] = describe(v, l.denial);
-            one["translator_status"] = v.call.status;
-            if (v.check_rule >= 0) one["check_rule"] = v.check_rule;
-            if (v.check_id >= 0) one["check_id"] = v.check_id;
-            if (v.apply >= 0) one["apply"] = v.apply;
-            if (v.msgno != 0) {
-                one["message_number"] = v.msgno;
-                one["message"] = v.message;
-            }
-            if (!v.rule_text.empty()) one["rule"] = v.rule_text;
-            if (!v.id_text.empty()) one["id"] = v.id_text;
-            one["decided"] = static_cast<long>(k) == decided;
-        }
-        lines.push_back(std::move(one));
-    }
-    r.json["lines"] = std::move(lines);
-    if (decided >= 0 && aligned) {
-        const Line &l = x.lines[x.entry_line[static_cast<size_t>(decided)]];
-        r.json["decided_by"] = {{"file", l.file}, {"line", l.number}, {"text", l.text}};
+    r.json["files"] = x.files;
+    r.json["id"] = x.id_text.empty() ? Json() : Json(x.id_text);
+    r.json["line_count"] = x.lines.size();
+    if (a.decided >= 0 && x.aligned) {
+        const Line &l = x.lines[x.entry_line[static_cast<size_t>(a.decided)]];
+        r.json["decided_by"] = {{"file", x.file_names[l.file]}, {"line", l.number}, {"text", l.text}};
     } else {
         r.json["decided_by"] = nullptr;
     }
+    r.stream_key = "lines";
+    r.stream = [&a](const std::function<void(const Json &)> &sink) { each_line(a, sink); };
     return r;
 }
 
-void text_explain(const Json &j) {
+void text_explain(const ExplainArgs &a, const Json &j) {
     fmt::print("explain {} {}\n", j["mechanism"].get<std::string>(), j["identity"].get<std::string>());
-    if (!j.contains("lines")) return;
+    if (!j.contains("files")) return;
     for (const Json &f : j["files"])
         fmt::print("  file {:<34} {}\n", f["path"].get<std::string>(),
                    !f["present"].get<bool>() ? "absent" : f["read"].get<bool>() ? "selected" : "present, not used (superseded)");
     if (j["files"].empty()) fmt::print("  (the map files were not read in this call)\n");
-    for (const Json &l : j["lines"]) {
+    each_line(a, [&j](const Json &l) {
         std::string where = fmt::format("{}:{}", l["file"].get<std::string>(), l["line"].get<size_t>());
-        std::string text = printable(l["text"]);
+        fmt::print("  {}: {}\n", where, printable(l["text"]));
         if (l["verdict"] == "ignored") {
-            fmt::print("  {}: {}\n      ignored by the parser: invalid rule\n", where, text);
-            continue;
+            fmt::print("      ignored by the parser: invalid rule\n");
+            return;
         }
-        bool decides = l.value("decided", false);
-        fmt::print("  {}: {}\n      {}{}\n", where, text, printable(l["detail"]), decides ? "   <== decides" : "");
+        fmt::print("      {}{}\n", printable(l["detail"]), l.value("decided", false) ? "   <== decides" : "");
         if (l["verdict"] == "no match") {
             if (l.contains("rule")) fmt::print("      rule: {}\n", printable(l["rule"]));
-            if (l.contains("id")) fmt::print("      id:   {}\n", printable(l["id"]));
+            if (!j["id"].is_null()) fmt::print("      id:   {}\n", printable(j["id"]));
         }
-    }
+    });
     std::string answer = j["answer"];
     if (!j["decided_by"].is_null())
         fmt::print("answer: {}, decided by {}:{}\n", answer, j["decided_by"]["file"].get<std::string>(),
                    j["decided_by"]["line"].get<size_t>());
-    else if (j["status"] == 0 && j["lines"].empty())
+    else if (j["status"] == 0 && j["line_count"] == 0)
         fmt::print("answer: {}: the map files hold no line of {}\n", answer, j["mechanism"].get<std::string>());
     else
         fmt::print("answer: {}\n", answer);
@@ -339,7 +353,7 @@ void add_explain(CLI::App &app, Options &o, CommandList &out) {
         "Exit status: as for map.");
     sub->add_option("MECH", a->mechanism, "the mechanism's mnemonic")->required();
     sub->add_option("IDENTITY", a->identity, "one network identity")->required();
-    out.push_back({sub, [&o, a] { return run_explain(o, *a); }, text_explain});
+    out.push_back({sub, [&o, a] { return run_explain(o, *a); }, [a](const Json &j) { text_explain(*a, j); }});
 }
 
 }  // namespace oxidm_tool

@@ -195,7 +195,19 @@ int main(int argc, char **argv) {
             r.json["errors"] = std::move(errors);
         }
         r.json["exit_status"] = r.exit;
-        print_json(r.json);
+        if (!r.stream) {
+            print_json(r.json);
+        } else {
+            std::string head = r.json.dump(-1, ' ', false, Json::error_handler_t::replace);
+            head.pop_back();  // the closing brace
+            fmt::print("{},\"{}\":[", head, r.stream_key);
+            bool first = true;
+            r.stream([&first](const Json &element) {
+                fmt::print("{}{}", first ? "" : ",", element.dump(-1, ' ', false, Json::error_handler_t::replace));
+                first = false;
+            });
+            fmt::print("]}}\n");
+        }
     } else {
         if (text && (r.exit != kExitError || r.json.size() > 0)) text(r.json);
         std::fflush(stdout);

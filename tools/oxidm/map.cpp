@@ -29,6 +29,7 @@ Result run_map(const Options &o, const MapArgs &a) {
     for (const std::string &identity : a.identities) {
         bool matched = false;
         Watch w;
+        w.wants = [](int id) { return id == idm::trace::tp::kApplyMatched || id == idm::trace::tp::kApplyResult; };
         w.on_record = [&](const TraceRecord &t) {
             namespace tp = idm::trace::tp;
             if (t.id == tp::kApplyMatched || t.id == tp::kApplyResult) matched = true;

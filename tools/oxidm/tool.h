@@ -27,6 +27,10 @@ struct Result {
     Json json = Json::object();
     // "WHAT: TEXT" pairs: on stderr as text, under "errors" in JSON.
     std::vector<std::pair<std::string, std::string>> errors;
+    // A long array rendered one element at a time after `json` under
+    // `stream_key`, so that no document of it is held whole in memory.
+    std::string stream_key;
+    std::function<void(const std::function<void(const Json &)> &)> stream;
     void fail(const std::string &what, const std::string &text) {
         errors.emplace_back(what, text);
         exit = kExitError;

@@ -123,13 +123,15 @@ size_t captured_count() { return trx_count(); }
 
 namespace {
 std::function<void(const TraceRecord &)> g_sink;
+bool (*g_wants)(int id) = nullptr;
 bool g_forget = true;
 size_t g_delivered = 0;
 void drain_hook(int) { drain_records(); }
 }  // namespace
 
-void stream_records(std::function<void(const TraceRecord &)> sink, bool forget) {
+void stream_records(std::function<void(const TraceRecord &)> sink, bool forget, bool (*wants)(int id)) {
     g_sink = std::move(sink);
+    g_wants = wants;
     g_forget = forget;
     if (forget) trx_clear();
     g_delivered = trx_count();
@@ -138,9 +140,24 @@ void stream_records(std::function<void(const TraceRecord &)> sink, bool forget) 
 
 void drain_records() {
     if (!g_sink) return;
-    std::vector<TraceRecord> records = captured_records(g_delivered);
+    std::vector<TraceRecord> records;
+    size_t n = trx_count();
+    for (size_t i = g_delivered; i < n; ++i) {
+        int id = 0, kind = 0, items = 0;
+        if (trx_record(i, &id, &kind, &items) != 0) break;
+        if (g_wants && !g_wants(id)) continue;
+        TraceRecord r;
+        r.id = id;
+        r.kind = kind;
+        for (int j = 0; j < items; ++j) {
+            size_t len = 0;
+            const void *p = trx_item(i, j, &len);
+            r.items.emplace_back(p ? std::string(static_cast<const char *>(p), len) : std::string());
+        }
+        records.push_back(std::move(r));
+    }
     if (g_forget) trx_clear();
-    g_delivered = g_forget ? 0 : g_delivered + records.size();
+    g_delivered = g_forget ? 0 : n;
     for (const TraceRecord &r : records) g_sink(r);
 }
 

@@ -44,7 +44,8 @@ size_t captured_count();
 // Hands every record to `sink` as soon as it is written and, with `forget`,
 // drops it from the stand-in's memory, so that no cap on kept records
 // limits a long walk (null: stop).  The sink must not call the library.
-void stream_records(std::function<void(const TraceRecord &)> sink, bool forget);
+// `wants`, when given, picks the ids the sink is shown (no component set).
+void stream_records(std::function<void(const TraceRecord &)> sink, bool forget, bool (*wants)(int id) = nullptr);
 // Hands over the records written since the last call (streaming only).
 void drain_records();
 

@@ -63,7 +63,7 @@ MapOutcome map_watched(const Options &o, const std::string &mnemonic, const std:
     g_watch = std::move(watch);
     g_called = false;
     // Under `oxidm trace` the records stay for it to print.
-    stream_records(g_watch.on_record, !o.tracing);
+    stream_records(g_watch.on_record, !o.tracing, g_watch.wants);
     MapOutcome out;
     idm_buffer local{0, nullptr};
     clear_library_error();

@@ -27,6 +27,8 @@ struct TranslatorCall {
 };
 
 struct Watch {
+    // The ids on_record is shown (null: all).
+    bool (*wants)(int id) = nullptr;
     // Called with each trace record, in order.
     std::function<void(const TraceRecord &)> on_record;
     // Called before each translator call (every earlier record delivered).
