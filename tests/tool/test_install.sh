@@ -61,6 +61,11 @@ if [[ $(id -u) == 0 ]]; then
   "$prefix/bin/oxidm" --root "$prefix/share/doc/oxidm/examples" --json cluster any no-such-host.invalid >/dev/null || rc=$?
   [[ $rc == 1 ]] || fail "installed oxidm --root: exit $rc"
 fi
+# A plug-in built outside the tree against the installed headers only, loaded by path.
+cp "$src/mpm/oxmpm_host.c" "$src/mpm/oxmpm_host.h" "$work/"
+# shellcheck disable=SC2046
+cc $cflags -shared -fPIC -DOXMPM_SHARED_OBJECT -o "$work/host.so" "$work/oxmpm_host.c" $(pkg-config --cflags --libs oxidm)
+"$prefix/bin/oxidm" --plugin "$work/host.so" mechanisms | grep -q "($work/host.so)" || fail "--plugin of an outside plug-in"
 echo "installed oxidm: ok"
 
 # Debian package

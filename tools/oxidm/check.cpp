@@ -313,7 +313,7 @@ Result check_config() {
                                    : "active cluster: " + active);
     r.json["files"] = std::move(files);
     r.json["active_cluster"] = active.empty() ? Json() : Json(active);
-    r.json["errors"] = errors;
+    r.json["error_count"] = errors;
     r.json["notes"] = std::move(notes);
     if (errors > 0) r.at_least(kExitNoAnswer);
     return r;

@@ -4,12 +4,12 @@
 // time).
 #include "tracefmt.h"
 
+#include <fmt/core.h>
+
 #include <algorithm>
-#include <cctype>
 #include <cstring>
 #include <deque>
-#include <functional>
-#include <string_view>
+#include <sstream>
 
 #include "ox_tr.h"
 #include "oxidm_tracepoints.h"
@@ -39,38 +39,48 @@ const std::vector<TraceIdInfo> &table() {
     return rows;
 }
 
-bool is_address_name(const char *name) {
-    if (name == nullptr) return true;
-    return name[0] != '#';
+const char *raw_name(const TraceIdInfo *info, size_t j) { return info && j < 8 ? info->items[j] : nullptr; }
+bool is_address_name(const char *name) { return name == nullptr || name[0] != '#'; }
+const char *item_name(const TraceIdInfo *info, size_t j) {
+    const char *n = raw_name(info, j);
+    return n && n[0] == '#' ? n + 1 : n;
 }
 
 std::string quoted_text(std::string_view s) {
     std::string out = "\"";
     for (unsigned char c : s) {
-        if (c == '"' || c == '\\') {
-            out += '\\';
-            out += static_cast<char>(c);
-        } else if (c == '\n') {
-            out += "\\n";
-        } else if (c == '\r') {
-            out += "\\r";
-        } else if (c == '\t') {
-            out += "\\t";
-        } else if (c < 0x20 || c >= 0x7f) {
-            char buf[8];
-            std::snprintf(buf, sizeof buf, "\\x%02x", c);
-            out += buf;
-        } else {
-            out += static_cast<char>(c);
-        }
+        if (c == '"' || c == '\\') out += {'\\', static_cast<char>(c)};
+        else if (c == '\n') out += "\\n";
+        else if (c == '\r') out += "\\r";
+        else if (c == '\t') out += "\\t";
+        else if (c < 0x20 || c >= 0x7f) out += fmt::format("\\x{:02x}", c);
+        else out += static_cast<char>(c);
     }
     return out + "\"";
 }
 
-const char *item_name(const TraceIdInfo *info, size_t j) {
-    if (info == nullptr || j >= 8 || info->items[j] == nullptr) return nullptr;
-    return info->items[j][0] == '#' ? info->items[j] + 1 : info->items[j];
+// Record i of the stand-in's memory, or id -1 when there is none.
+TraceRecord kept(size_t i, bool with_component, bool (*wants)(int)) {
+    TraceRecord r;
+    int items = 0;
+    if (trx_record(i, &r.id, &r.kind, &items) != 0 || (wants && !wants(r.id))) {
+        r.id = -1;
+        return r;
+    }
+    if (with_component) r.component = trx_component(i) ? trx_component(i) : "";
+    for (int j = 0; j < items; ++j) {
+        size_t len = 0;
+        const void *p = trx_item(i, j, &len);
+        r.items.emplace_back(p ? std::string(static_cast<const char *>(p), len) : std::string());
+    }
+    return r;
 }
+
+std::function<void(const TraceRecord &)> g_sink;
+bool (*g_wants)(int id) = nullptr;
+bool g_forget = true;
+size_t g_delivered = 0;
+void drain_hook(int) { drain_records(); }
 
 }  // namespace
 
@@ -95,22 +105,13 @@ int64_t TraceRecord::i64(size_t j) const {
 bool TraceRecord::is_text(size_t j) const {
     if (j >= items.size() || items[j].empty() || items[j].back() != '\0') return false;
     if (kind == TRX_STRINGS) return true;
-    // A 4- or 8-byte item ending in a zero byte may be a number: texts are
-    // recognised by their printable bytes before the NUL.
+    // A 4- or 8-byte item ending in a zero byte may be a number: numbers win
+    // unless every byte before the NUL is printable.
     const std::string &s = items[j];
-    for (size_t i = 0; i + 1 < s.size(); ++i) {
-        unsigned char c = static_cast<unsigned char>(s[i]);
-        if (c == 0) return false;
-        if (c < 0x20 && c != '\t' && c != '\r' && c != '\n') return false;
-    }
-    if (s.size() == 4 || s.size() == 8) {
-        // "abc" and "abcdefg" are as likely as small numbers; numbers win
-        // unless every byte before the NUL is printable and non-zero.
-        for (size_t i = 0; i + 1 < s.size(); ++i)
-            if (static_cast<unsigned char>(s[i]) < 0x20) return false;
-        return s.size() > 1;
-    }
-    return true;
+    bool fixed = s.size() == 4 || s.size() == 8;
+    return std::all_of(s.begin(), s.end() - 1, [fixed](unsigned char c) {
+               return c >= 0x20 || (!fixed && c != 0 && (c == '\t' || c == '\r' || c == '\n'));
+           }) && s.size() > 1;
 }
 
 std::string TraceRecord::text(size_t j) const {
@@ -121,13 +122,11 @@ std::string TraceRecord::text(size_t j) const {
 
 size_t captured_count() { return trx_count(); }
 
-namespace {
-std::function<void(const TraceRecord &)> g_sink;
-bool (*g_wants)(int id) = nullptr;
-bool g_forget = true;
-size_t g_delivered = 0;
-void drain_hook(int) { drain_records(); }
-}  // namespace
+std::vector<TraceRecord> captured_records(size_t from) {
+    std::vector<TraceRecord> out;
+    for (size_t i = from, n = trx_count(); i < n; ++i) out.push_back(kept(i, true, nullptr));
+    return out;
+}
 
 void stream_records(std::function<void(const TraceRecord &)> sink, bool forget, bool (*wants)(int id)) {
     g_sink = std::move(sink);
@@ -142,77 +141,30 @@ void drain_records() {
     if (!g_sink) return;
     std::vector<TraceRecord> records;
     size_t n = trx_count();
-    for (size_t i = g_delivered; i < n; ++i) {
-        int id = 0, kind = 0, items = 0;
-        if (trx_record(i, &id, &kind, &items) != 0) break;
-        if (g_wants && !g_wants(id)) continue;
-        TraceRecord r;
-        r.id = id;
-        r.kind = kind;
-        for (int j = 0; j < items; ++j) {
-            size_t len = 0;
-            const void *p = trx_item(i, j, &len);
-            r.items.emplace_back(p ? std::string(static_cast<const char *>(p), len) : std::string());
-        }
-        records.push_back(std::move(r));
-    }
+    for (size_t i = g_delivered; i < n; ++i)
+        if (TraceRecord r = kept(i, false, g_wants); r.id != -1) records.push_back(std::move(r));
     if (g_forget) trx_clear();
     g_delivered = g_forget ? 0 : n;
     for (const TraceRecord &r : records) g_sink(r);
 }
 
-std::vector<TraceRecord> captured_records(size_t from) {
-    std::vector<TraceRecord> out;
-    size_t n = trx_count();
-    for (size_t i = from; i < n; ++i) {
-        TraceRecord r;
-        int items = 0;
-        if (trx_record(i, &r.id, &r.kind, &items) != 0) break;
-        const char *c = trx_component(i);
-        r.component = c ? c : "";
-        for (int j = 0; j < items; ++j) {
-            size_t len = 0;
-            const void *p = trx_item(i, j, &len);
-            r.items.emplace_back(p ? std::string(static_cast<const char *>(p), len) : std::string());
-        }
-        out.push_back(std::move(r));
-    }
-    return out;
-}
-
 bool parse_levels(const std::string &text, TraceLevels &out) {
-    static constexpr const char *kNames[] = {"error", "api", "mapping", "milestone", "diag"};
+    static constexpr std::string_view kNames[] = {"error", "api", "mapping", "milestone", "diag"};
     TraceLevels levels;
-    size_t pos = 0;
-    int position = 0;
-    while (pos <= text.size()) {
-        size_t comma = text.find(',', pos);
-        if (comma == std::string::npos) comma = text.size();
-        std::string item = text.substr(pos, comma - pos);
-        std::string key, value = item;
-        if (size_t eq = item.find('='); eq != std::string::npos) {
-            key = item.substr(0, eq);
-            value = item.substr(eq + 1);
-        }
+    std::istringstream items(text);
+    std::string item;
+    for (int position = 0; std::getline(items, item, ','); ++position) {
+        size_t eq = item.find('=');
+        std::string key = eq == std::string::npos ? "" : item.substr(0, eq), value = item.substr(eq + 1);
         if (value.empty() || value.size() > 3 || !std::all_of(value.begin(), value.end(), ::isdigit)) return false;
         int v = std::stoi(value);
-        if (v > 255) return false;
         std::transform(key.begin(), key.end(), key.begin(), [](unsigned char c) { return std::tolower(c); });
-        if (key.empty()) {
-            if (position >= 5) return false;
-            levels.level[position] = static_cast<unsigned char>(v);
-        } else if (key == "all") {
-            for (unsigned char &l : levels.level) l = static_cast<unsigned char>(v);
-        } else {
-            int cat = -1;
-            for (int k = 0; k < 5; ++k)
-                if (key == kNames[k]) cat = k;
-            if (cat < 0) return false;
-            levels.level[cat] = static_cast<unsigned char>(v);
-        }
-        ++position;
-        pos = comma + 1;
+        auto cat = std::find(std::begin(kNames), std::end(kNames), key) - std::begin(kNames);
+        if (v > 255 || (key.empty() && position >= 5) || (!key.empty() && key != "all" && cat == 5)) return false;
+        for (int c = 0; c < 5; ++c)
+            if (key == "all" || c == (key.empty() ? position : cat)) levels.level[c] = static_cast<unsigned char>(v);
     }
+    if (text.empty() || text.back() == ',') return false;
     out = levels;
     return true;
 }
@@ -222,47 +174,25 @@ void apply_levels(const TraceLevels &levels) {
 }
 
 std::string decode_item(const TraceRecord &r, size_t j) {
-    const TraceIdInfo *info = trace_id_info(r.id);
     const std::string &s = r.items[j];
-    const char *raw_name = info && j < 8 ? info->items[j] : nullptr;
     if (r.is_text(j)) return quoted_text(r.text(j));
     if (s.size() == 4) return std::to_string(r.i32(j));
-    if (s.size() == 8) {
-        if (!is_address_name(raw_name)) return std::to_string(r.i64(j));
-        char buf[32];
-        std::snprintf(buf, sizeof buf, "0x%llx", static_cast<unsigned long long>(r.i64(j)));
-        return buf;
-    }
+    if (s.size() == 8)
+        return is_address_name(raw_name(trace_id_info(r.id), j)) ? fmt::format("0x{:x}", static_cast<uint64_t>(r.i64(j)))
+                                                                 : std::to_string(r.i64(j));
     std::string hex = "<";
-    for (unsigned char c : s) {
-        char buf[4];
-        std::snprintf(buf, sizeof buf, "%02x", c);
-        hex += buf;
-    }
+    for (unsigned char c : s) hex += fmt::format("{:02x}", c);
     return hex + ">";
 }
 
 std::string format_record(const TraceRecord &r) {
     const TraceIdInfo *info = trace_id_info(r.id);
-    char head[64];
-    std::snprintf(head, sizeof head, "%4d ", r.id);
-    std::string out = head;
+    std::string out = fmt::format("{:4} ", r.id);
     if (r.component != "_SEI" && !r.component.empty()) out += "[" + r.component + "] ";
-    if (info != nullptr) {
-        out += info->routine;
-        out += ' ';
-        out += info->what;
-    } else if (r.id < 0) {
-        out += "(unreadable line)";
-    } else {
-        out += "(unknown id)";
-    }
+    out += info ? fmt::format("{} {}", info->routine, info->what) : r.id < 0 ? "(unreadable line)" : "(unknown id)";
     for (size_t j = 0; j < r.items.size(); ++j) {
         out += j == 0 ? ": " : ", ";
-        if (const char *name = item_name(info, j)) {
-            out += name;
-            out += '=';
-        }
+        if (const char *name = item_name(info, j)) out += fmt::format("{}=", name);
         out += decode_item(r, j);
     }
     return out;
@@ -270,16 +200,16 @@ std::string format_record(const TraceRecord &r) {
 
 nlohmann::ordered_json records_json(const std::vector<TraceRecord> &records) {
     nlohmann::ordered_json out = nlohmann::ordered_json::array();
+    auto opt = [](const char *t) { return t ? nlohmann::ordered_json(t) : nlohmann::ordered_json(); };
     for (const TraceRecord &r : records) {
         const TraceIdInfo *info = trace_id_info(r.id);
-        auto opt = [](const char *t) { return t ? nlohmann::ordered_json(t) : nlohmann::ordered_json(); };
         nlohmann::ordered_json items = nlohmann::ordered_json::array();
         for (size_t j = 0; j < r.items.size(); ++j) {
             nlohmann::ordered_json item{{"name", opt(item_name(info, j))}};
             const std::string &s = r.items[j];
             if (r.is_text(j)) item["text"] = r.text(j);
             else if (s.size() == 4) item["int"] = r.i32(j);
-            else if (s.size() == 8 && !is_address_name(info && j < 8 ? info->items[j] : nullptr)) item["int"] = r.i64(j);
+            else if (s.size() == 8 && !is_address_name(raw_name(info, j))) item["int"] = r.i64(j);
             else item["raw"] = decode_item(r, j);
             items.push_back(std::move(item));
         }
@@ -289,92 +219,64 @@ nlohmann::ordered_json records_json(const std::vector<TraceRecord> &records) {
     return out;
 }
 
-// The stand-in writes: COMPONENT ID then items, each " \"text\"" (no
-// escaping), " N" (4-byte), " 0xH" (8-byte) or " <hex>" (other).
+namespace {
+
+// One item of the stand-in's text form at `pos` (after its space): " \"text\""
+// (no escaping: the text runs to the last '"' followed by the start of
+// another item or the end), " N" (4-byte), " 0xH" (8-byte), " <hex>".
+bool read_item(const std::string &line, size_t &pos, std::vector<std::string> &items) {
+    if (line[pos] == '"') {
+        for (size_t q = line.find('"', pos + 1); q != std::string::npos; q = line.find('"', q + 1))
+            if (q + 1 == line.size() || (line[q + 1] == ' ' && q + 2 < line.size() &&
+                                         std::strchr("\"<-0123456789", line[q + 2]) != nullptr)) {
+                items.push_back(line.substr(pos + 1, q - pos - 1) + '\0');
+                pos = q + 1;
+                return true;
+            }
+        return false;
+    }
+    size_t end = std::min(line.find(' ', pos), line.size());
+    std::string tok = line.substr(pos, end - pos);
+    pos = end;
+    char *rest = nullptr;
+    if (tok.size() > 2 && tok.compare(0, 2, "0x") == 0) {
+        uint64_t v = std::strtoull(tok.c_str() + 2, &rest, 16);
+        items.emplace_back(reinterpret_cast<const char *>(&v), 8);
+    } else if (tok.size() > 2 && tok.front() == '<' && tok.back() == '>') {
+        std::string bytes;
+        for (size_t k = 1; k + 2 < tok.size(); k += 2)
+            bytes += static_cast<char>(std::strtoul(tok.substr(k, 2).c_str(), nullptr, 16));
+        items.push_back(bytes);
+        return true;
+    } else {
+        auto v = static_cast<int32_t>(std::strtol(tok.c_str(), &rest, 10));
+        items.emplace_back(reinterpret_cast<const char *>(&v), 4);
+    }
+    return !tok.empty() && rest != nullptr && *rest == '\0';
+}
+
+}  // namespace
+
 std::vector<TraceRecord> read_trace_file(FILE *f) {
     std::vector<TraceRecord> out;
     std::string line;
-    int c;
     auto flush = [&]() {
         TraceRecord r;
-        size_t sp = line.find(' ');
-        bool ok = sp != std::string::npos && sp > 0;
-        size_t pos = 0;
+        r.kind = TRX_DATA;
+        size_t sp = line.find(' '), end = std::min(line.find(' ', sp + 1), line.size());
+        std::string id = sp == std::string::npos ? "" : line.substr(sp + 1, end - sp - 1);
+        bool ok = sp > 0 && !id.empty() && id.size() < 9 && std::all_of(id.begin(), id.end(), ::isdigit);
         if (ok) {
             r.component = line.substr(0, sp);
-            pos = sp + 1;
-            size_t end = line.find(' ', pos);
-            if (end == std::string::npos) end = line.size();
-            std::string id = line.substr(pos, end - pos);
-            ok = !id.empty() && std::all_of(id.begin(), id.end(), ::isdigit) && id.size() < 9;
-            if (ok) r.id = std::stoi(id);
-            pos = end;
+            r.id = std::stoi(id);
         }
-        r.kind = TRX_DATA;
-        while (ok && pos < line.size()) {
-            if (line[pos] != ' ') {
-                ok = false;
-                break;
-            }
-            ++pos;
-            if (pos >= line.size()) break;
-            if (line[pos] == '"') {
-                // Texts are written unescaped: the item runs to the last '"'
-                // that is followed by a space and a token start, or the end.
-                size_t q = pos + 1, close = std::string::npos;
-                while (q < line.size()) {
-                    size_t next = line.find('"', q);
-                    if (next == std::string::npos) break;
-                    if (next + 1 == line.size() ||
-                        (line[next + 1] == ' ' && next + 2 < line.size() &&
-                         (line[next + 2] == '"' || line[next + 2] == '<' || line[next + 2] == '-' ||
-                          std::isdigit(static_cast<unsigned char>(line[next + 2]))))) {
-                        close = next;
-                        break;
-                    }
-                    q = next + 1;
-                }
-                if (close == std::string::npos) {
-                    ok = false;
-                    break;
-                }
-                r.items.push_back(line.substr(pos + 1, close - pos - 1) + '\0');
-                pos = close + 1;
-            } else {
-                size_t end = line.find(' ', pos);
-                if (end == std::string::npos) end = line.size();
-                std::string tok = line.substr(pos, end - pos);
-                pos = end;
-                if (tok.size() > 2 && tok[0] == '0' && tok[1] == 'x') {
-                    unsigned long long v = std::strtoull(tok.c_str() + 2, nullptr, 16);
-                    r.items.emplace_back(reinterpret_cast<const char *>(&v), 8);
-                } else if (tok.size() > 2 && tok.front() == '<' && tok.back() == '>') {
-                    std::string bytes;
-                    for (size_t k = 1; k + 2 < tok.size(); k += 2)
-                        bytes += static_cast<char>(std::strtoul(tok.substr(k, 2).c_str(), nullptr, 16));
-                    r.items.push_back(bytes);
-                } else if (!tok.empty()) {
-                    char *endp = nullptr;
-                    long v = std::strtol(tok.c_str(), &endp, 10);
-                    if (endp == nullptr || *endp != '\0') {
-                        ok = false;
-                        break;
-                    }
-                    int32_t v32 = static_cast<int32_t>(v);
-                    r.items.emplace_back(reinterpret_cast<const char *>(&v32), 4);
-                }
-            }
-        }
-        if (!ok) {
-            r = TraceRecord{};
-            r.id = -1;
-            r.kind = TRX_STRINGS;
-            r.items.push_back(line + '\0');
-        }
+        for (size_t pos = end; ok && pos < line.size();)
+            ok = line[pos] == ' ' && (++pos == line.size() || read_item(line, pos, r.items));
+        if (!ok) r = TraceRecord{-1, TRX_STRINGS, "", {line + '\0'}};
         out.push_back(std::move(r));
         line.clear();
     };
-    while ((c = std::fgetc(f)) != EOF) {
+    for (int c; (c = std::fgetc(f)) != EOF;) {
         if (c == '\n') flush();
         else line += static_cast<char>(c);
     }
