@@ -364,17 +364,18 @@ MapfileReport check_mapfile_text(std::string_view text, const MapContext &ctx) {
         pos = end;
         bool ends_line = !piece.empty() && piece.back() == '\n';
         size_t this_line = line_no;
+        auto add = [&](Severity s, const char *code, std::string message) {
+            report.findings.push_back({this_line, s, code, std::move(message)});
+        };
         if (!continuing && !ends_line && piece.size() == kPieceMax && pos < text.size())
-            report.findings.push_back({this_line, Severity::kWarning, "long-line",
-                                       "longer than 1023 characters: the library reads it as several lines, "
-                                       "each judged on its own"});
+            add(Severity::kWarning, "long-line",
+                "longer than 1023 characters: the library reads it as several lines, each judged on its own");
         if (ends_line) ++line_no;
         continuing = !ends_line;
         // The parser sees the piece as a C string: up to its first NUL.
         std::string_view seen = piece.substr(0, piece.find('\0'));
         if (seen.size() != piece.size() && piece.find_first_not_of(std::string_view("\0\n", 2)) != std::string_view::npos)
-            report.findings.push_back({this_line, Severity::kWarning, "nul-byte",
-                                       "holds a NUL byte: the library reads the line only up to it"});
+            add(Severity::kWarning, "nul-byte", "holds a NUL byte: the library reads the line only up to it");
         std::string_view body = seen;
         if (size_t nl = body.find('\n'); nl != std::string_view::npos) body = body.substr(0, nl);
         size_t hash = body.find('#');
@@ -385,26 +386,23 @@ MapfileReport check_mapfile_text(std::string_view text, const MapContext &ctx) {
         if (first == body.size()) continue;  // empty, blank or comment only
         size_t colon = body.find(':', first);
         if (colon == std::string_view::npos) {
-            report.findings.push_back({this_line, Severity::kWarning, "no-selector",
-                                       "no ':' after a mechanism name: every mechanism ignores this line"});
+            add(Severity::kWarning, "no-selector", "no ':' after a mechanism name: every mechanism ignores this line");
             continue;
         }
         std::string selector(body.substr(first, colon - first));
         std::string mech = mechanism ? *mechanism : selector;
         if (mechanism && selector != *mechanism) {
             if (same_ignoring_case(trim_blanks(selector), *mechanism))
-                report.findings.push_back({this_line, Severity::kWarning, "selector-mismatch",
-                                           "selector \"" + show(selector) + "\" is not \"" + *mechanism +
-                                               "\" (case and blanks count): ignored for " + *mechanism});
+                add(Severity::kWarning, "selector-mismatch",
+                    fmt::format("selector \"{}\" is not \"{}\" (case and blanks count): ignored for {}", show(selector),
+                                *mechanism, *mechanism));
             else
-                report.findings.push_back({this_line, Severity::kNote, "other-mechanism",
-                                           "a line of mechanism \"" + show(selector) + "\": ignored for " +
-                                               *mechanism});
+                add(Severity::kNote, "other-mechanism",
+                    "a line of mechanism \"" + show(selector) + "\": ignored for " + *mechanism);
             continue;
         }
         if (selector.empty()) {
-            report.findings.push_back({this_line, Severity::kWarning, "empty-selector",
-                                       "empty mechanism selector: no mechanism reads this line"});
+            add(Severity::kWarning, "empty-selector", "empty mechanism selector: no mechanism reads this line");
             continue;
         }
         if (!mechanism && known && std::find(known->begin(), known->end(), selector) == known->end()) {
@@ -412,36 +410,28 @@ MapfileReport check_mapfile_text(std::string_view text, const MapContext &ctx) {
                 return same_ignoring_case(trim_blanks(selector), k);
             });
             if (like != known->end())
-                report.findings.push_back({this_line, Severity::kWarning, "selector-mismatch",
-                                           "selector \"" + show(selector) + "\" is not \"" + *like +
-                                               "\" (case and blanks count): mechanism " + *like + " ignores it"});
+                add(Severity::kWarning, "selector-mismatch",
+                    fmt::format("selector \"{}\" is not \"{}\" (case and blanks count): mechanism {} ignores it",
+                                show(selector), *like, *like));
             else
-                report.findings.push_back({this_line, Severity::kNote, "unknown-mechanism",
-                                           "no known mechanism is named \"" + show(selector) + "\""});
+                add(Severity::kNote, "unknown-mechanism", "no known mechanism is named \"" + show(selector) + "\"");
         } else if (!mechanism && (blank(selector.back()) || trim_blanks(selector) != selector))
-            report.findings.push_back({this_line, Severity::kWarning, "selector-blank",
-                                       "selector \"" + show(selector) +
-                                           "\" ends in a blank: it selects no mechanism whose name lacks it"});
+            add(Severity::kWarning, "selector-blank",
+                "selector \"" + show(selector) + "\" ends in a blank: it selects no mechanism whose name lacks it");
 
         idm::mapfile::LineVerdict v = idm::mapfile::judge_line(mech, piece.substr(0, seen.size()));
         if (v.kind == LineKind::kSkipped) continue;  // cannot happen for a matching selector
         if (v.kind == LineKind::kInvalid) {
-            report.findings.push_back({this_line, Severity::kError, "invalid-rule",
-                                       "invalid rule, ignored by the library: " + invalid_reason(body, comment_cut)});
+            add(Severity::kError, "invalid-rule", "invalid rule, ignored by the library: " + invalid_reason(body, comment_cut));
             continue;
         }
-        MapEntry e;
-        e.line = this_line;
-        e.mechanism = mech;
-        e.kind = v.kind == LineKind::kDenial ? EntryKind::kDenial : EntryKind::kAffirmative;
-        e.network_id = v.network_id;
-        e.local_id = v.local_id;
+        MapEntry e{this_line, mech, v.kind == LineKind::kDenial ? EntryKind::kDenial : EntryKind::kAffirmative,
+                   std::string(v.network_id), std::string(v.local_id)};
         ignored_text(v, body, this_line, report.findings);
         std::string_view last = e.kind == EntryKind::kDenial ? std::string_view(e.network_id)
                                                              : std::string_view(e.local_id);
         if (!last.empty() && last.back() == '\r')
-            report.findings.push_back({this_line, Severity::kWarning, "carriage-return",
-                                       "ends in a carriage return, which becomes part of the identifier"});
+            add(Severity::kWarning, "carriage-return", "ends in a carriage return, which becomes part of the identifier");
         const Translator *t = ctx.translator_for ? ctx.translator_for(mech) : nullptr;
         if (t != nullptr) judge_rule(*t, e, report.findings);
         else if (std::find(report.parsed_only.begin(), report.parsed_only.end(), mech) == report.parsed_only.end())
@@ -531,22 +521,18 @@ struct Collector {
             for (std::string_view v : values[a]) {
                 size_t line = line_of(v);
                 auto [it, fresh] = seen.emplace(std::make_pair(address, std::string(v)), line);
-                if (!fresh) {
+                unsigned char buf[16];
+                std::string s(v);
+                if (!fresh)
                     findings->push_back({line, Severity::kWarning, "host-repeated",
-                                         std::string(address ? "address" : "host name") + " \"" + show(v) +
-                                             "\" is already listed at line " + std::to_string(it->second) +
-                                             ": the first record's clusters are used"});
-                    continue;
-                }
-                if (!address) {
-                    unsigned char buf[16];
-                    std::string s(v);
-                    if (inet_pton(AF_INET, s.c_str(), buf) == 1 || inet_pton(AF_INET6, s.c_str(), buf) == 1)
-                        findings->push_back({line, Severity::kWarning, "name-is-address",
-                                             "NAME value \"" + show(v) +
-                                                 "\" reads as an address: queries for it search only the "
-                                                 "ADDRESS values, so it is never found"});
-                }
+                                         fmt::format("{} \"{}\" is already listed at line {}: the first record's "
+                                                     "clusters are used", address ? "address" : "host name", show(v),
+                                                     it->second)});
+                else if (!address && (inet_pton(AF_INET, s.c_str(), buf) == 1 || inet_pton(AF_INET6, s.c_str(), buf) == 1))
+                    findings->push_back({line, Severity::kWarning, "name-is-address",
+                                         fmt::format("NAME value \"{}\" reads as an address: queries for it search "
+                                                     "only the ADDRESS values, so it is never found", show(v))});
+                if (!fresh) continue;
                 if (keep) hosts.push_back({std::string(v), address, clusters, line});
             }
         }
@@ -554,19 +540,20 @@ struct Collector {
     }
 };
 
-const char *point_reason(int point) {
+const char *point_reason(idm::trace::tp::Id point) {
+    namespace tp = idm::trace::tp;
     switch (point) {
-        case 157: return "host record incomplete: it needs a CLUSTER value and a NAME or ADDRESS value";
-        case 164: return "NODE without ':' on its line";
-        case 165: return "NAME outside a host record (no NODE before it), or a second NAME line with values";
-        case 166: return "NAME without ':' on its line";
-        case 167: return "ADDRESS outside a host record (no NODE before it), or a second ADDRESS line with values";
-        case 168: return "ADDRESS without ':' on its line";
-        case 169: return "CLUSTER outside a host record (no NODE before it), or a second CLUSTER line with values";
-        case 170: return "CLUSTER without ':' on its line";
-        case 171: return "the statement begins with none of NODE, NAME, ADDRESS, CLUSTER";
+        case tp::kNodeRecordIncomplete: return "host record incomplete: it needs a CLUSTER value and a NAME or ADDRESS value";
+        case tp::kNodeNoColon: return "NODE without ':' on its line";
+        case tp::kNameMisplaced: return "NAME outside a host record (no NODE before it), or a second NAME line with values";
+        case tp::kNameNoColon: return "NAME without ':' on its line";
+        case tp::kAddressMisplaced: return "ADDRESS outside a host record (no NODE before it), or a second ADDRESS line with values";
+        case tp::kAddressNoColon: return "ADDRESS without ':' on its line";
+        case tp::kClusterMisplaced: return "CLUSTER outside a host record (no NODE before it), or a second CLUSTER line with values";
+        case tp::kClusterNoColon: return "CLUSTER without ':' on its line";
+        case tp::kNoKeyword: return "the statement begins with none of NODE, NAME, ADDRESS, CLUSTER";
+        default: return "invalid entry";
     }
-    return "invalid entry";
 }
 
 // Offset of the first line after `line` (1-based) whose statement is NODE.
@@ -582,43 +569,30 @@ size_t next_node_statement(std::string_view text, const LineIndex &index, size_t
 // Statements whose keyword is longer than its name ("Nodes", "NAMES ="):
 // accepted by the library, worth a note.
 void keyword_notes(std::string_view text, const LineIndex &index, std::vector<Finding> &out) {
-    static constexpr std::pair<idm::clmap::Keyword, std::string_view> kWords[] = {
-        {idm::clmap::Keyword::kNode, "NODE"},
-        {idm::clmap::Keyword::kName, "NAME"},
-        {idm::clmap::Keyword::kAddress, "ADDRESS"},
-        {idm::clmap::Keyword::kCluster, "CLUSTER"}};
+    using idm::clmap::Keyword;
+    static constexpr std::string_view kWords[] = {"", "NODE", "NAME", "ADDRESS", "CLUSTER"};
+    auto trim = [](std::string_view v) {
+        while (!v.empty() && std::isspace(static_cast<unsigned char>(v.front()))) v.remove_prefix(1);
+        while (!v.empty() && std::isspace(static_cast<unsigned char>(v.back()))) v.remove_suffix(1);
+        return v;
+    };
     for (size_t l = 0; l < index.starts.size(); ++l) {
-        size_t p = index.starts[l];
-        size_t end = text.find('\n', p);
-        if (end == std::string_view::npos) end = text.size();
-        while (p < end && std::isspace(static_cast<unsigned char>(text[p]))) ++p;
-        if (p >= end || text[p] == '#') continue;
-        std::string_view stmt = text.substr(p, end - p);
-        idm::clmap::Keyword k = idm::clmap::keyword_of(stmt);
+        std::string_view stmt = trim(text.substr(index.starts[l], text.find('\n', index.starts[l]) - index.starts[l]));
+        Keyword k = stmt.empty() || stmt[0] == '#' ? Keyword::kNone : idm::clmap::keyword_of(stmt);
         size_t colon = stmt.find(':');
-        if (k == idm::clmap::Keyword::kNone || colon == std::string_view::npos) continue;
-        std::string head = trim_blanks(stmt.substr(0, colon));
-        for (auto [kw, word] : kWords) {
-            if (kw == k && !same_ignoring_case(head, word))
-                out.push_back({l + 1, Severity::kNote, "keyword-prefix",
-                               "\"" + show(head) + "\" is read as the keyword " + std::string(word) +
-                                   " (only its first " + std::to_string(word.size()) + " characters count)"});
-        }
-        // Values that look like comments or hold tabs.
-        if (k != idm::clmap::Keyword::kNode) {
-            std::string_view list = stmt.substr(colon + 1);
-            size_t hash = list.find('#');
-            if (hash != std::string_view::npos &&
-                (hash == 0 || list[hash - 1] == ' ' || list[hash - 1] == '\t'))
-                out.push_back({l + 1, Severity::kWarning, "hash-value",
-                               "'#' after ':' is not a comment: it and what follows are stored as values"});
-            std::string_view trimmed = list;
-            while (!trimmed.empty() && std::isspace(static_cast<unsigned char>(trimmed.front()))) trimmed.remove_prefix(1);
-            while (!trimmed.empty() && std::isspace(static_cast<unsigned char>(trimmed.back()))) trimmed.remove_suffix(1);
-            if (trimmed.find('\t') != std::string_view::npos)
-                out.push_back({l + 1, Severity::kWarning, "tab-in-value",
-                               "a tab does not separate values: it is kept inside one"});
-        }
+        if (k == Keyword::kNone || colon == std::string_view::npos) continue;
+        std::string_view word = kWords[static_cast<int>(k)], head = trim(stmt.substr(0, colon));
+        if (!same_ignoring_case(head, word))
+            out.push_back({l + 1, Severity::kNote, "keyword-prefix",
+                           fmt::format("\"{}\" is read as the keyword {} (only its first {} characters count)",
+                                       show(head), word, word.size())});
+        std::string_view list = stmt.substr(colon + 1);
+        size_t hash = list.find('#');
+        if (k != Keyword::kNode && hash != std::string_view::npos && (hash == 0 || blank(list[hash - 1])))
+            out.push_back({l + 1, Severity::kWarning, "hash-value",
+                           "'#' after ':' is not a comment: it and what follows are stored as values"});
+        if (k != Keyword::kNode && trim(list).find('\t') != std::string_view::npos)
+            out.push_back({l + 1, Severity::kWarning, "tab-in-value", "a tab does not separate values: it is kept inside one"});
     }
 }
 

@@ -54,8 +54,8 @@ struct MapEntry {
     std::string network_id;
     std::string local_id;  // empty for a denial
     bool usable = false;   // the translator filled a rule the library accepts
-    std::string rgy_type, rgy;
-    std::vector<std::string> tokens;
+    std::string rgy_type = {}, rgy = {};
+    std::vector<std::string> tokens = {};
     int32_t name_token = 0;  // 1-based token that supplies the local name of a "*" mapping, else 0
 };
 
