@@ -1,6 +1,6 @@
 // oxidm check [mapfile FILE [--mech M] | nodeinfo FILE | config]: every line
 // the library would ignore or reject, and warnings an administrator wants.
-#include "check.h"
+#include "tool.h"
 
 #include <fmt/core.h>
 #include <pwd.h>
@@ -10,7 +10,6 @@
 #include <algorithm>
 #include <cerrno>
 #include <cstring>
-#include <deque>
 #include <fstream>
 #include <sstream>
 
@@ -25,10 +24,10 @@ using check::Severity;
 
 // Who besides root can change what `st` describes: its owner when not root,
 // its group when group-writable and not root's, everyone when world-writable.
-std::string writers(const struct stat &st, bool owner_counts) {
+std::string writers(const struct stat &st) {
     std::string who;
     auto add = [&](const std::string &w) { who += (who.empty() ? "" : ", ") + w; };
-    if (owner_counts && st.st_uid != 0) {
+    if (st.st_uid != 0) {
         struct passwd *pw = getpwuid(st.st_uid);
         add("its owner " + (pw ? std::string(pw->pw_name) : std::to_string(st.st_uid)));
     }
@@ -56,7 +55,7 @@ void directory_findings(const std::string &path, std::vector<Finding> &out) {
     for (std::string dir = parent_of(child);; dir = parent_of(dir)) {
         struct stat st, below;
         if (stat(dir.c_str(), &st) == 0) {
-            std::string who = writers(st, true);
+            std::string who = writers(st);
             bool safe_sticky = (st.st_mode & S_ISVTX) && lstat(child.c_str(), &below) == 0 && below.st_uid == 0;
             if (!who.empty() && !safe_sticky)
                 out.push_back({0, Severity::kWarning, "directory-writable",
@@ -81,16 +80,16 @@ void permission_findings(const std::string &path, std::vector<Finding> &out) {
         std::string target = real;
         std::free(real);
         out.push_back({0, Severity::kNote, "symbolic-link", "a symbolic link to " + target});
-        if (stat(target.c_str(), &st) == 0 && !writers(st, true).empty())
+        if (stat(target.c_str(), &st) == 0 && !writers(st).empty())
             out.push_back({0, Severity::kWarning, "file-writable",
                            fmt::format("its target {} is writable by someone other than root ({})", target,
-                                       writers(st, true))});
+                                       writers(st))});
         directory_findings(target, out);
         return;
     }
-    if (stat(path.c_str(), &st) == 0 && !writers(st, true).empty())
+    if (stat(path.c_str(), &st) == 0 && !writers(st).empty())
         out.push_back({0, Severity::kWarning, "file-writable",
-                       "the file is writable by someone other than root (" + writers(st, true) + ")"});
+                       "the file is writable by someone other than root (" + writers(st) + ")"});
     directory_findings(path, out);
 }
 
@@ -124,12 +123,8 @@ const std::vector<check::Account> &privileged_accounts() {
 }
 
 const check::Translator *translator_for(const std::string &mnemonic) {
-    static std::deque<std::pair<std::string, check::Translator>> known;
-    for (const auto &[name, t] : known)
-        if (name == mnemonic) return &t;
     const Mechanism *m = find_mechanism(mnemonic);
-    if (m == nullptr) return nullptr;
-    return &known.emplace_back(mnemonic, check::Translator{m->translator, m->cleanup}).second;
+    return m ? &m->routines : nullptr;
 }
 
 void sort_findings(std::vector<Finding> &f) {
@@ -251,58 +246,37 @@ Result check_one(const CheckArgs &a) {
 // them at all), the node information file, the active cluster's name.
 Result check_config() {
     struct Candidate {
-        const char *path, *role;
+        const char *path, *role, *absent;
     };
-    static constexpr Candidate kMaps[] = {
-        {kLocalMap, "local map file, read first"},
-        {kVarGlobalMap, "global map file, read after the local one"},
-        {kOptGlobalMap, "global map file, read only while /var/ox/cfg/oxsec_map.global is absent"}};
+    static constexpr Candidate kFiles[] = {
+        {kLocalMap, "local map file, read first", "absent"},
+        {kVarGlobalMap, "global map file, read after the local one", "absent"},
+        {kOptGlobalMap, "global map file, read only while /var/ox/cfg/oxsec_map.global is absent", "absent"},
+        {kNodeInfo, "node information file", "absent: every cluster query answers -1"}};
     Result r;
     Json files = Json::array(), notes = Json::array();
     size_t errors = 0;
-    bool present[3] = {false, false, false}, known[3] = {true, true, true};
-    std::string error;
-    for (int i = 0; i < 3; ++i)
-        if (!(known[i] = exists(kMaps[i].path, present[i], error)))
-            r.fail("check", "cannot tell whether it exists: " + error);
+    bool present[4] = {};
     std::vector<check::MapEntry> local_entries;
-    for (int i = 0; i < 3; ++i) {
-        if (!known[i]) continue;
-        if (!present[i]) {
-            notes.push_back(std::string(kMaps[i].path) + ": absent");
-            continue;
-        }
-        std::string text;
-        if (!read_file(kMaps[i].path, text, error)) {
-            r.fail("check", error);
-            continue;
-        }
+    for (int i = 0; i < 4; ++i) {
+        std::string text, error;
+        if (!exists(kFiles[i].path, present[i], error)) r.fail("check", "cannot tell whether it exists: " + error);
+        else if (!present[i]) notes.push_back(fmt::format("{}: {}", kFiles[i].path, kFiles[i].absent));
+        else if (!read_file(kFiles[i].path, text, error)) r.fail("check", error);
+        if (!present[i] || !error.empty()) continue;
         bool in_use = i != 2 || !present[1];
-        // A rule of the global file that the local file shadows never fires.
-        Checked c = check_map_text(kMaps[i].path, text, nullptr, i > 0 && in_use ? &local_entries : nullptr, kLocalMap);
+        // A rule of a global file that the local file shadows never fires.
+        Checked c = i == 3 ? check_node_text(kNodeInfo, text)
+                           : check_map_text(kFiles[i].path, text, nullptr, i > 0 && in_use ? &local_entries : nullptr,
+                                            kLocalMap);
         if (!in_use)
-            c.findings.insert(c.findings.begin(), {0, Severity::kNote, "superseded",
-                                                   "not read: /var/ox/cfg/oxsec_map.global exists"});
+            c.findings.insert(c.findings.begin(),
+                              {0, Severity::kNote, "superseded", "not read: /var/ox/cfg/oxsec_map.global exists"});
         if (i == 0) local_entries = c.map_report.entries;
         errors += c.count(Severity::kError);
         Json one = checked_json(c);
-        one["role"] = kMaps[i].role;
+        one["role"] = kFiles[i].role;
         one["used"] = in_use;
-        files.push_back(std::move(one));
-    }
-    bool node_present = false;
-    if (!exists(kNodeInfo, node_present, error)) {
-        r.fail("check", "cannot tell whether it exists: " + error);
-    } else if (!node_present) {
-        notes.push_back(std::string(kNodeInfo) + ": absent: every cluster query answers -1");
-    } else if (std::string text; !read_file(kNodeInfo, text, error)) {
-        r.fail("check", error);
-    } else {
-        Checked c = check_node_text(kNodeInfo, text);
-        errors += c.count(Severity::kError);
-        Json one = checked_json(c);
-        one["role"] = "node information file";
-        one["used"] = true;
         files.push_back(std::move(one));
     }
     cu_cluster_info_t info{};
@@ -337,19 +311,8 @@ void add_check(CLI::App &app, Options &, CommandList &out) {
     auto a = std::make_shared<CheckArgs>();
     CLI::App *sub = app.add_subcommand("check", "check configuration files as the library reads them");
     sub->footer(
-        "mapfile FILE: every line of an identity mapping file that libox_idm would ignore or reject, with its\n"
-        "line number and the library's reason.  Each rule of a known mechanism (built in, or loaded with\n"
-        "--plugin) goes through its translator and the library's rule check; other mechanisms' lines are\n"
-        "parsed only, and the output says so.  Warnings: the file, a directory above it (up to /) or a\n"
-        "symbolic link's target writable by anyone but root; a wildcard identifier mapped to a uid-0\n"
-        "account; a pass-through mapping (\"=*\") that can yield root or another account below UID_MIN\n"
-        "(/etc/login.defs) with no earlier denial refusing it; a denial that can never take effect because\n"
-        "an earlier line matches everything it names (proved with the library's matcher).  With --mech only\n"
-        "MECH's lines are judged.\n\n"
-        "nodeinfo FILE: the node information file as the cluster map loads it: an invalid statement or the\n"
-        "library's memory bound makes it load nothing; NUL bytes, repeated hosts, '#' taken as a value.\n\n"
-        "config (or nothing): every file the library would read now (with --root, under DIR), in its order.\n\n"
-        "Exit status: 0 no errors (warnings allowed), 1 errors, 2 a file cannot be read.");
+        "mapfile FILE, nodeinfo FILE, or config (every file the library would read now): each line judged as\n"
+        "the library judges it, with warnings (see oxidm(1)).  Exit status: 0 no errors, 1 errors, 2 unreadable.");
     sub->add_option("WHAT", a->what, "mapfile, nodeinfo or config")
         ->check(CLI::IsMember({"mapfile", "nodeinfo", "config"}));
     sub->add_option("FILE", a->file, "the file to check (mapfile, nodeinfo)");

@@ -119,6 +119,15 @@ std::string trim_blanks(std::string_view s) {
 
 }  // namespace
 
+std::string one_line(const char *text) {
+    std::string out;
+    for (const char *p = text ? text : ""; *p; ++p)
+        if (!std::isspace(static_cast<unsigned char>(*p))) out += *p;
+        else if (!out.empty() && out.back() != ' ' && p[1] != '\0' && !std::isspace(static_cast<unsigned char>(p[1])))
+            out += ' ';
+    return out;
+}
+
 const char *severity_name(Severity s) {
     switch (s) {
         case Severity::kError: return "error";
@@ -138,23 +147,6 @@ size_t NodeinfoReport::warnings() const { return count_of(*this, Severity::kWarn
 // ---------------------------------------------------------------------------
 
 namespace {
-
-// The library's current message on one line, without its origin.
-std::string reported() {
-    std::string out;
-    if (!cux_error_pending()) return out;
-    bool space = false;
-    for (const char *p = cux_error_text(); p && *p; ++p) {
-        if (*p == '\n' || *p == '\t' || *p == ' ') {
-            space = !out.empty();
-            continue;
-        }
-        if (space) out += ' ';
-        space = false;
-        out += *p;
-    }
-    return out;
-}
 
 // Has the mechanism's translator make the entry's rule, and the library
 // check it, as the mapping walk does.  Adds the verdict to `out`.
@@ -184,7 +176,7 @@ void judge_rule(const Translator &t, MapEntry &e, std::vector<Finding> &out) {
                        fmt::format("the {} translator makes no rule of this line (status {})", e.mechanism, status)});
     } else if (idm__native_check_rule(&rule) != 0) {
         out.push_back({e.line, Severity::kError, "invalid-rule",
-                       "the library rejects this rule: " + reported()});
+                       "the library rejects this rule: " + one_line(cux_error_text())});
     } else {
         e.usable = true;
         e.rgy_type = rule.rgy_type;

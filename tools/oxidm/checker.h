@@ -26,6 +26,8 @@
 namespace oxidm_tool::check {
 
 enum class Severity { kError, kWarning, kNote };
+// A library message on one line: runs of blanks and line feeds become one space.
+std::string one_line(const char *text);
 const char *severity_name(Severity s);
 
 struct Finding {

@@ -87,13 +87,8 @@ void add_cluster(CLI::App &app, Options &o, CommandList &out) {
     auto a = std::make_shared<ClusterArgs>();
     CLI::App *sub = app.add_subcommand("cluster", "whether hosts are in a known cluster / the active cluster");
     sub->footer(
-        "any:    sec_is_in_any_cluster: is the host (name or address text, compared exactly) listed in\n"
-        "        /var/ox/cfg/oxsec.nodeinfo?\n"
-        "active: sec_is_in_active_cluster: is it listed in the active cluster, whose name libox_cu reads\n"
-        "        from /var/ox/cfg/active_cluster?\n"
         "Answers: 1 yes, 0 listed but not in the active cluster, -1 not listed (or the file could not be\n"
-        "loaded: then the library's message is shown).\n\n"
-        "Exit status: 0 every answer is 1, 1 some host is not in, 2 an error.");
+        "loaded).  Exit status: 0 every answer is 1, 1 some host is not in, 2 an error.");
     sub->add_option("QUERY", a->query, "any or active")->required()->check(CLI::IsMember({"any", "active"}));
     sub->add_option("HOST", a->hosts, "host names or address texts")->required();
     out.push_back({sub, [&o, a] { return run_cluster(o, *a); }, text_cluster});

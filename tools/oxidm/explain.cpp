@@ -7,7 +7,7 @@
 #include <fmt/core.h>
 
 #include "oxidm_tracepoints.h"
-#include "watch.h"
+#include "tool.h"
 
 namespace oxidm_tool {
 
@@ -71,97 +71,54 @@ struct Explanation {
     }
 
     void parse_record(const TraceRecord &r) {
-        switch (r.id) {
-            case tp::kTestFilesState:
-                if (r.items.size() >= 4) {
-                    Json f{{"path", r.text(1)}, {"present", r.i32(2) != 0}, {"read", r.i32(3) != 0}};
-                    for (Json &known : files)
-                        if (known["path"] == f["path"]) {
-                            known = f;
-                            return;
-                        }
-                    files.push_back(std::move(f));
-                }
-                break;
-            case tp::kParseFile:
-                file_names.push_back(r.text(0));
-                next_number = 1;
-                break;
-            case tp::kParseLine: {
-                // A piece of at most 1023 characters; a line goes on while
-                // its pieces end without a line feed.
-                std::string t = r.text(0);
-                bool ends_line = (!t.empty() && t.back() == '\n') || t.size() < 1023;
-                if (!t.empty() && t.back() == '\n') t.pop_back();
-                current = Line{};
-                current.file = file_names.empty() ? 0 : static_cast<uint32_t>(file_names.size() - 1);
-                current.number = next_number;
-                current.text = std::move(t);
-                if (ends_line) ++next_number;
-                break;
-            }
-            case tp::kEntriesInvalidLine:
-                lines.push_back(current);
-                lines.back().invalid = true;
-                break;
-            case tp::kEntriesNewEntry:
+        if (r.id == tp::kTestFilesState && r.items.size() >= 4) {
+            Json f{{"path", r.text(1)}, {"present", r.i32(2) != 0}, {"read", r.i32(3) != 0}};
+            auto known = std::find_if(files.begin(), files.end(), [&f](const Json &k) { return k["path"] == f["path"]; });
+            if (known != files.end()) *known = f;
+            else files.push_back(std::move(f));
+        } else if (r.id == tp::kParseFile) {
+            file_names.push_back(r.text(0));
+            next_number = 1;
+        } else if (r.id == tp::kParseLine) {
+            // A piece of at most 1023 characters; a line goes on while its
+            // pieces end without a line feed.
+            std::string t = r.text(0);
+            bool lf = !t.empty() && t.back() == '\n';
+            if (lf) t.pop_back();
+            current = Line{static_cast<uint32_t>(file_names.empty() ? 0 : file_names.size() - 1), false, false,
+                           next_number, std::move(t)};
+            if (lf || current.text.size() < 1023) ++next_number;
+        } else if (r.id == tp::kEntriesInvalidLine || r.id == tp::kEntriesNewEntry) {
+            if (r.id == tp::kEntriesNewEntry) {
                 entry_line.push_back(lines.size());
                 entry_id.push_back(r.text(2));
-                lines.push_back(current);
-                lines.back().denial = r.text(1).rfind("Denial", 0) == 0;
-                break;
-            default:
-                break;
+            }
+            lines.push_back(current);
+            lines.back().invalid = r.id == tp::kEntriesInvalidLine;
+            lines.back().denial = r.id == tp::kEntriesNewEntry && r.text(1).rfind("Denial", 0) == 0;
         }
     }
 
     void walk_record(const TraceRecord &r) {
         if (verdicts.empty()) return;
         Verdict &v = verdicts.back();
+        auto dump = [&](decltype(dumping) what, size_t at) {
+            finish_dump();
+            dumping = what;
+            rgy_type = r.text(at);
+            rgy = r.text(at + 1);
+        };
         switch (r.id) {
-            case tp::kDumpRule:
-                finish_dump();
-                dumping = kRule;
-                rgy_type = r.text(1);
-                rgy = r.text(2);
-                break;
-            case tp::kDumpId:
-                finish_dump();
-                dumping = kId;
-                rgy_type = r.text(0);
-                rgy = r.text(1);
-                break;
-            case tp::kDumpToken:
-                if (dumping != kNone) tokens.push_back(r.text(1));
-                break;
-            case tp::kDumpRuleMapping:
-                has_mapping = true;
-                mapping = r.text(1);
-                break;
-            case tp::kCheckRuleExitData:
-                finish_dump();
-                v.check_rule = r.i32(0);
-                break;
-            case tp::kCheckIdExitData:
-                finish_dump();
-                v.check_id = r.i32(0);
-                break;
-            case tp::kApplyMatched:
-                v.matched = true;
-                break;
-            case tp::kApplyResult: {
-                v.matched = true;
-                std::string value = r.text(0);
-                v.result = value == "[null]" ? "" : value;
-                break;
-            }
-            case tp::kApplyExitData:
-                finish_dump();
-                v.apply = r.i32(0);
-                if (v.apply == 0) v.matched = true;
-                break;
-            default:
-                break;
+            case tp::kDumpRule: dump(kRule, 1); break;
+            case tp::kDumpId: dump(kId, 0); break;
+            case tp::kDumpToken: if (dumping != kNone) tokens.push_back(r.text(1)); break;
+            case tp::kDumpRuleMapping: has_mapping = true, mapping = r.text(1); break;
+            case tp::kCheckRuleExitData: finish_dump(), v.check_rule = r.i32(0); break;
+            case tp::kCheckIdExitData: finish_dump(), v.check_id = r.i32(0); break;
+            case tp::kApplyMatched: v.matched = true; break;
+            case tp::kApplyResult: v.matched = true, v.result = r.text(0) == "[null]" ? "" : r.text(0); break;
+            case tp::kApplyExitData: finish_dump(), v.apply = r.i32(0), v.matched = v.matched || v.apply == 0; break;
+            default: break;
         }
     }
 
@@ -346,11 +303,8 @@ void add_explain(CLI::App &app, Options &o, CommandList &out) {
     auto a = std::make_shared<ExplainArgs>();
     CLI::App *sub = app.add_subcommand("explain", "which map file line decided, and why earlier lines did not");
     sub->footer(
-        "Maps IDENTITY as `oxidm map` does and shows how the library got there: which map files it read,\n"
-        "every line of MECH in the order it tried them, why each line before the deciding one did not match\n"
-        "(the library's own message), and the file and line that decided.  Lines the parser ignored as\n"
-        "invalid are shown too.  The source is the library's trace (API level 8, Mapping 8, Diag 1).\n\n"
-        "Exit status: as for map.");
+        "Every line of MECH in the order the library tried it, with the library's reason, up to the line\n"
+        "that decided.  Exit status: as for map.");
     sub->add_option("MECH", a->mechanism, "the mechanism's mnemonic")->required();
     sub->add_option("IDENTITY", a->identity, "one network identity")->required();
     out.push_back({sub, [&o, a] { return run_explain(o, *a); }, [a](const Json &j) { text_explain(*a, j); }});

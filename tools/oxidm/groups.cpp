@@ -53,9 +53,7 @@ void add_groups(CLI::App &app, Options &, CommandList &out) {
     auto users = std::make_shared<std::vector<std::string>>();
     CLI::App *sub = app.add_subcommand("groups", "a local user's groups, primary group first");
     sub->footer(
-        "Lists each local user's groups as sec_idm_get_groups answers: the primary group first, then every\n"
-        "group whose member list names the user, in the order of the group database.\n\n"
-        "Exit status: 0 all users found, 2 an error (unknown user: 2650-698).");
+        "The groups as sec_idm_get_groups lists them.  Exit status: 0 all users found, 2 an error.");
     sub->add_option("USER", *users, "local user names")->required();
     out.push_back({sub, [users] { return run_groups(*users); }, text_groups});
 }

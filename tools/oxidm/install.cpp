@@ -8,13 +8,12 @@
 #include <fcntl.h>
 #include <fmt/core.h>
 #include <sys/stat.h>
-#include <time.h>
 #include <unistd.h>
 
 #include <cerrno>
 #include <cstring>
 
-#include "check.h"
+#include "tool.h"
 
 namespace oxidm_tool {
 
@@ -38,27 +37,14 @@ struct InstallArgs {
 
 std::string why(const std::string &what) { return fmt::format("{}: {}", what, std::strerror(errno)); }
 
-// A descriptor closed on every way out.
-struct Fd {
-    int fd;
-    explicit Fd(int f) : fd(f) {}
-    Fd(const Fd &) = delete;
-    Fd &operator=(const Fd &) = delete;
-    ~Fd() {
-        if (fd >= 0) close(fd);
-    }
-};
-
 // Waits up to 10 s for the whole-file write lock on `fd`.
 bool write_lock(int fd) {
-    struct flock fl{};
+    struct flock fl {};
     fl.l_type = F_WRLCK;
-    fl.l_whence = SEEK_SET;
     for (int tries = 0; tries < 1000; ++tries) {
         if (fcntl(fd, F_OFD_SETLK, &fl) == 0) return true;
         if (errno != EAGAIN && errno != EACCES && errno != EINTR) return false;
-        struct timespec ten_ms{0, 10'000'000};
-        nanosleep(&ten_ms, nullptr);
+        usleep(10'000);
     }
     errno = ETIMEDOUT;
     return false;
@@ -68,41 +54,40 @@ bool write_lock(int fd) {
 // file is removed on failure.
 std::string replace(const std::string &target, const std::string &text) {
     std::string dir = target.substr(0, target.rfind('/'));
-    struct stat dst{}, old{};
-    if (stat(dir.c_str(), &dst) != 0 || !S_ISDIR(dst.st_mode))
-        return errno ? why(dir) : dir + ": not a directory";
+    struct stat dst {}, old {};
+    if (stat(dir.c_str(), &dst) != 0 || !S_ISDIR(dst.st_mode)) return errno ? why(dir) : dir + ": not a directory";
     bool had_old = lstat(target.c_str(), &old) == 0;
     if (!had_old && errno != ENOENT) return why(target);
     if (had_old && !S_ISREG(old.st_mode)) return target + ": not a regular file (not replaced)";
-    uid_t uid = had_old ? old.st_uid : geteuid();
-    gid_t gid = had_old ? old.st_gid : getegid();
-    mode_t mode = had_old ? (old.st_mode & 07777) : 0644;
-
     std::string tmp = dir + "/." + target.substr(dir.size() + 1) + ".oxidm-XXXXXX";
-    Fd fd(mkstemp(tmp.data()));
-    if (fd.fd < 0) return why("creating a temporary file in " + dir);
+    int fd = mkstemp(tmp.data());
+    if (fd < 0) return why("creating a temporary file in " + dir);
     std::string error;
-    size_t done = 0;
-    while (error.empty() && done < text.size()) {
-        ssize_t n = write(fd.fd, text.data() + done, text.size() - done);
+    for (size_t done = 0; error.empty() && done < text.size();) {
+        ssize_t n = write(fd, text.data() + done, text.size() - done);
         if (n < 0 && errno == EINTR) continue;
         if (n <= 0) error = why("writing " + tmp);
         else done += static_cast<size_t>(n);
     }
-    if (error.empty() && fchown(fd.fd, uid, gid) != 0) error = why("giving " + tmp + " the target's owner");
-    if (error.empty() && fchmod(fd.fd, mode) != 0) error = why("giving " + tmp + " the target's mode");
-    if (error.empty() && fsync(fd.fd) != 0) error = why("syncing " + tmp);
-    // Readers of the old file hold its shared lock while they parse it.
-    Fd lock(had_old ? open(target.c_str(), O_WRONLY | O_CLOEXEC | O_NOFOLLOW | O_NONBLOCK) : -1);
-    if (error.empty() && had_old && (lock.fd < 0 || !write_lock(lock.fd))) error = why("locking " + target);
+    if (error.empty() && fchown(fd, had_old ? old.st_uid : geteuid(), had_old ? old.st_gid : getegid()) != 0)
+        error = why("giving " + tmp + " the target's owner");
+    if (error.empty() && fchmod(fd, had_old ? old.st_mode & 07777 : 0644) != 0) error = why("giving " + tmp + " the target's mode");
+    if (error.empty() && fsync(fd) != 0) error = why("syncing " + tmp);
+    close(fd);
+    // Readers of the old file hold its shared lock while they parse it; the
+    // lock goes with the descriptor, after the rename.
+    int lock = had_old ? open(target.c_str(), O_WRONLY | O_CLOEXEC | O_NOFOLLOW | O_NONBLOCK) : -1;
+    if (error.empty() && had_old && (lock < 0 || !write_lock(lock))) error = why("locking " + target);
     if (error.empty() && rename(tmp.c_str(), target.c_str()) != 0) error = why("renaming " + tmp + " to " + target);
+    if (lock >= 0) close(lock);
     if (!error.empty()) {
         unlink(tmp.c_str());
         return error;
     }
-    Fd dirfd(open(dir.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
-    if (dirfd.fd < 0 || fsync(dirfd.fd) != 0) return why("syncing " + dir + " (the file is in place)");
-    return "";
+    int dirfd = open(dir.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+    bool synced = dirfd >= 0 && fsync(dirfd) == 0;
+    if (dirfd >= 0) close(dirfd);
+    return synced ? "" : why("syncing " + dir + " (the file is in place)");
 }
 
 Result run_install(const Options &o, const InstallArgs &a) {
@@ -154,15 +139,9 @@ void add_install(CLI::App &app, Options &o, CommandList &out) {
     auto a = std::make_shared<InstallArgs>();
     CLI::App *sub = app.add_subcommand("install", "replace a map file or the node information file safely");
     sub->footer(
-        "TARGET: local (/var/ox/cfg/oxsec_map.local), global (/var/ox/cfg/oxsec_map.global), opt-global\n"
-        "(/opt/helvo/cfg/oxsec_map.global) or nodeinfo (/var/ox/cfg/oxsec.nodeinfo); with --root DIR the\n"
-        "same path under DIR.\n\n"
-        "FILE is checked as `oxidm check` does; errors refuse it, and so do warnings unless\n"
-        "--accept-warnings is given.  It is then written to a temporary file in the target's directory with\n"
-        "the target's owner and mode (a new target: the caller's, mode 0644), synced, and renamed into place\n"
-        "while the write lock that map file readers respect is held on the old file; the directory is\n"
-        "synced.  The target's directory must exist.\n\n"
-        "Exit status: 0 installed, 2 not installed (the reason on stderr).");
+        "TARGET: local, global, opt-global or nodeinfo (under DIR with --root).  FILE is checked; errors\n"
+        "refuse it, warnings too unless accepted; it replaces the target by rename (see oxidm(1)).\n"
+        "Exit status: 0 installed, 2 not installed.");
     sub->add_option("TARGET", a->target, "local, global, opt-global or nodeinfo")
         ->required()
         ->check(CLI::IsMember({"local", "global", "opt-global", "nodeinfo"}));

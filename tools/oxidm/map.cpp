@@ -3,7 +3,7 @@
 #include <fmt/core.h>
 
 #include "oxidm_tracepoints.h"
-#include "watch.h"
+#include "tool.h"
 
 namespace oxidm_tool {
 
@@ -68,12 +68,8 @@ void add_map(CLI::App &app, Options &o, CommandList &out) {
     auto a = std::make_shared<MapArgs>();
     CLI::App *sub = app.add_subcommand("map", "the local user each network identity maps to");
     sub->footer(
-        "Maps each network identity of mechanism MECH to a local user with sec_idm_map_identity, reading\n"
-        "/var/ox/cfg/oxsec_map.local, then /var/ox/cfg/oxsec_map.global or else\n"
-        "/opt/helvo/cfg/oxsec_map.global.  The first matching line decides: a local user, or none when it\n"
-        "is a denial.\n\n"
-        "Exit status: 0 every identity maps to a user, 1 some identity is granted no local identity, 2 an\n"
-        "error.");
+        "Maps each identity with sec_idm_map_identity; the first matching line of the map files decides.\n"
+        "Exit status: 0 every identity maps to a user, 1 some is granted none, 2 an error.");
     sub->add_option("MECH", a->mechanism, "the mechanism's mnemonic (see oxidm mechanisms)")->required();
     sub->add_option("IDENTITY", a->identities, "network identities")->required();
     out.push_back({sub, [&o, a] { return run_map(o, *a); }, text_map});

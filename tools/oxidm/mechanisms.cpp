@@ -8,8 +8,8 @@ namespace oxidm_tool {
 
 void add_mechanisms(CLI::App &app, Options &, CommandList &out) {
     CLI::App *sub = app.add_subcommand("mechanisms", "the mechanisms this command knows");
-    sub->footer("Lists the sample plug-ins this command is built with and those loaded with --plugin PATH,\n"
-                "with the form of their network identities.");
+    sub->footer(
+        "Built in, or loaded with --plugin PATH.");
     auto run = [] {
         Result r;
         r.json["mechanisms"] = Json::array();

@@ -11,6 +11,7 @@
 #include <string>
 #include <vector>
 
+#include "checker.h"
 #include "oxidm.h"
 #include "tracefmt.h"
 
@@ -19,7 +20,7 @@ namespace oxidm_tool {
 using Json = nlohmann::ordered_json;
 
 // Exit statuses: an answer, no answer (no mapping granted, host not listed,
-// errors in a checked file), an error (a message on stderr), bad usage.
+// errors in a checked file), an error or bad usage (a message on stderr).
 enum Exit : int { kExitAnswer = 0, kExitNoAnswer = 1, kExitError = 2 };
 
 struct Result {
@@ -54,8 +55,8 @@ struct Command {
     std::function<void(const Json &)> text;  // renders the result on stdout
     bool own_root = false;                   // handles --root itself (no namespace)
 };
-// Each command's file adds its subcommand to `app`.
 using CommandList = std::vector<Command>;
+// Each command's file adds its subcommand.
 void add_map(CLI::App &app, Options &o, CommandList &out);
 void add_explain(CLI::App &app, Options &o, CommandList &out);
 void add_groups(CLI::App &app, Options &o, CommandList &out);
@@ -64,56 +65,103 @@ void add_check(CLI::App &app, Options &o, CommandList &out);
 void add_install(CLI::App &app, Options &o, CommandList &out);
 void add_trace(CLI::App &app, Options &o, CommandList &out);
 void add_mechanisms(CLI::App &app, Options &o, CommandList &out);
-
-// Builds the whole command line interface into `app`.
-void build_cli(CLI::App &app, Options &o, CommandList &out);
-// Parses args into a fresh interface and runs the chosen command (used by
-// `oxidm trace`).  `usage` receives a usage error's text.
+// Parses args into a fresh interface and runs the chosen command (`oxidm
+// trace`); `text` receives the command's renderer.
 Result run_inner(Options &o, const std::vector<std::string> &args, std::function<void(const Json &)> &text);
 
-// ---- the library's reports ----
+// ---- the library's reports and files ----
 
-// The current error of libox_cu (this thread), one line, or "".
+// The current error of libox_cu (this thread) on one line, or "".
 std::string library_error();
 void clear_library_error();
 // "2650-666 libox_idm Failure: ..." reads "2650-666 ...".
 std::string short_message(const std::string &text);
+// A text for the terminal: control characters escaped.
+std::string printable(const std::string &s);
 
-// ---- files ----
-
-// Reads a whole regular file.  False with `error` ("PATH: reason") when the
-// path is not a regular file or cannot be opened or read: never "empty".
-bool read_file(const std::string &path, std::string &out, std::string &error);
-// Whether `path` exists.  False with `error` when that cannot be told
-// (a directory on the way cannot be searched, ...).
-bool exists(const std::string &path, bool &present, std::string &error);
-
-// ---- mechanisms ----
-
-struct Mechanism {
-    std::string mnemonic;
-    std::string summary;  // one line: what its identities look like
-    std::string source;   // "built in" or the plug-in's path
-    idm_translator_routine translator;
-    idm_cleanup_routine cleanup;
-};
-// Loads every --plugin once; false with `error` when one cannot be loaded.
-bool load_plugins(const Options &o, std::string &error);
-const std::vector<Mechanism> &mechanisms();
-const Mechanism *find_mechanism(const std::string &mnemonic);
-
-// The map files and the node information file, where the library looks.
 inline constexpr const char *kLocalMap = "/var/ox/cfg/oxsec_map.local";
 inline constexpr const char *kVarGlobalMap = "/var/ox/cfg/oxsec_map.global";
 inline constexpr const char *kOptGlobalMap = "/opt/helvo/cfg/oxsec_map.global";
 inline constexpr const char *kNodeInfo = "/var/ox/cfg/oxsec.nodeinfo";
-// The first of `paths` whose existence cannot be told (a directory on the
-// way cannot be searched), as an error text; "" when all can.  The library
-// takes such a file for absent; the command says so instead.
+// Reads a whole regular file; false with `error` ("PATH: reason") when the
+// path is not one or cannot be opened or read: never "empty".
+bool read_file(const std::string &path, std::string &out, std::string &error);
+// Whether `path` exists; false with `error` when that cannot be told (a
+// directory on the way cannot be searched).  The library takes such a file
+// for absent; the command says so instead.
+bool exists(const std::string &path, bool &present, std::string &error);
+// The first of `paths` whose existence cannot be told, as an error, or "".
 std::string unreadable_config(std::initializer_list<const char *> paths);
 
-// A text for the terminal: control characters escaped.
-std::string printable(const std::string &s);
+// ---- mechanisms ----
+
+struct Mechanism {
+    std::string mnemonic, summary;  // summary: what its identities look like
+    std::string source;             // "built in" or the plug-in's path
+    check::Translator routines;
+};
+// Loads every --plugin (see mpm/oxmpm_plugin.h); false with `error`.
+bool load_plugins(const Options &o, std::string &error);
+const std::vector<Mechanism> &mechanisms();
+// The latest loaded of that mnemonic, or null.
+const Mechanism *find_mechanism(const std::string &mnemonic);
+
+// ---- one mapping request, watched (map, explain) ----
+// The mechanism's routines are registered through wrappers that call them
+// unchanged and tell the watch of every translator call; the library's
+// trace records stream to it as they are written (none is kept), so a walk
+// over any number of lines is seen whole.
+
+struct TranslatorCall {
+    bool has_entry = false;
+    std::string network_id;
+    int32_t status = 0;
+    // The error reported since the previous call returned (while the
+    // previous entry was handled), or 0 and "".
+    int msgno_before = 0;
+    std::string message_before;
+};
+struct Watch {
+    bool (*wants)(int id) = nullptr;  // the record ids on_record is shown (null: all)
+    std::function<void(const TraceRecord &)> on_record;
+    std::function<void(const TranslatorCall &)> on_call_start;  // every earlier record delivered
+    std::function<void(const TranslatorCall &)> on_call_end;    // with the status
+};
+struct MapOutcome {
+    int32_t status = 0;
+    bool granted = false;
+    std::string local, error;
+    int msgno_after = 0;  // the error reported after the last translator call
+    std::string message_after;
+};
+// Registers the mechanism's watched routines; "" or the error.
+std::string register_watched(const std::string &mnemonic);
+// Maps one identity with the trace levels explain needs (`full`) or only the
+// match points.
+MapOutcome map_watched(const Options &o, const std::string &mnemonic, const std::string &identity, bool full,
+                       Watch watch);
+
+// ---- one configuration file checked (check, install) ----
+// The checker's verdicts plus what needs the system: owner and mode of the
+// file, of every directory above it and of a symbolic link's target, the
+// accounts below UID_MIN, the known mechanisms' translators.
+
+struct Checked {
+    std::string path;
+    bool map = true;
+    check::MapfileReport map_report;
+    check::NodeinfoReport node_report;
+    std::vector<check::Finding> findings;  // all, in line order
+    size_t count(check::Severity s) const;
+};
+// `mechanism`: only its lines; `earlier`: entries of the file the library
+// reads first, named `earlier_file`.
+Checked check_map_text(const std::string &path, const std::string &text, const std::string *mechanism,
+                       const std::vector<check::MapEntry> *earlier = nullptr, const std::string &earlier_file = "");
+Checked check_node_text(const std::string &path, const std::string &text);
+void permission_findings(const std::string &path, std::vector<check::Finding> &out);
+Json checked_json(const Checked &c);
+void checked_text(const Json &j);
 
 }  // namespace oxidm_tool
 

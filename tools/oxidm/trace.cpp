@@ -84,15 +84,9 @@ void add_trace(CLI::App &app, Options &o, CommandList &out) {
     auto a = std::make_shared<TraceArgs>();
     CLI::App *sub = app.add_subcommand("trace", "run a command with tracing on and print the records");
     sub->footer(
-        "Runs COMMAND (map, explain, groups, cluster, check, mechanisms) with the trace of component _SEI\n"
-        "switched on through the libox_tr stand-in, then prints the command's own output and every record:\n"
-        "its id, the routine that wrote it, and its items decoded.\n\n"
-        "LEVELS: per category, e.g. \"API=8,Mapping=8,Diag=1\" (the default, with Error=1), \"all=1\", or\n"
-        "five numbers in the order Error, API, Mapping, Milestone, Diag.  map and explain raise the levels\n"
-        "they need themselves.\n\n"
-        "trace decode FILE|-: reads records that the stand-in wrote to OX_TR_FILE (for instance\n"
-        "OX_TR_FILE=/tmp/t OX_TR_LEVELS=_SEI:API=8 some-program) and prints them the same way.\n\n"
-        "Exit status: that of COMMAND; decode: 0, or 2 when FILE cannot be read.");
+        "Runs COMMAND with the trace of _SEI on and prints every record decoded; decode FILE|- reads records\n"
+        "the stand-in wrote to OX_TR_FILE.  LEVELS: e.g. \"API=8,Diag=1\", \"all=1\" or five numbers (Error, API,\n"
+        "Mapping, Milestone, Diag).  Exit status: that of COMMAND.");
     sub->add_option("--levels", a->levels, "trace levels of _SEI")->type_name("LEVELS");
     sub->add_option("COMMAND", a->command, "the command to run and its arguments, or decode FILE");
     sub->prefix_command();

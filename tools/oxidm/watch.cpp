@@ -1,5 +1,5 @@
-// The watched translator and one mapping request (see watch.h).
-#include "watch.h"
+// The watched translator and one mapping request (declared in tool.h).
+#include "tool.h"
 
 #include <cstdlib>
 
@@ -25,17 +25,16 @@ int32_t watched_translate(const idm_mapfile_entry *entry, const char *network_id
     if (entry != nullptr) {
         c.has_entry = true;
         c.network_id = entry->network_id ? entry->network_id : "";
-        c.local_id = entry->local_id ? entry->local_id : "";
     }
     if (g_watch.on_call_start) g_watch.on_call_start(c);
-    c.status = g_mech->translator(entry, network_id, rule, id);
+    c.status = g_mech->routines.translate(entry, network_id, rule, id);
     g_called = true;
     g_errors_after = cux_error_count();
     if (g_watch.on_call_end) g_watch.on_call_end(c);
     return c.status;
 }
 
-int32_t watched_cleanup(idm_rule *rule, idm_id *id) { return g_mech->cleanup(rule, id); }
+int32_t watched_cleanup(idm_rule *rule, idm_id *id) { return g_mech->routines.cleanup(rule, id); }
 
 }  // namespace
 
