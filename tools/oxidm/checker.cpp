@@ -42,11 +42,6 @@ std::string show(std::string_view s) {
     return out;
 }
 
-template <class Report>
-size_t count_of(const Report &r, Severity s) {
-    return static_cast<size_t>(std::count_if(r.findings.begin(), r.findings.end(),
-                                             [s](const Finding &f) { return f.severity == s; }));
-}
 
 // Why the library found a selected line invalid (neither a denial nor an
 // affirmative mapping), for a line with the comment already cut and no line
@@ -129,22 +124,10 @@ std::string one_line(const char *text) {
 }
 
 const char *severity_name(Severity s) {
-    switch (s) {
-        case Severity::kError: return "error";
-        case Severity::kWarning: return "warning";
-        case Severity::kNote: return "note";
-    }
-    return "?";
+    static constexpr const char *kNames[] = {"error", "warning", "note"};
+    return kNames[static_cast<int>(s)];
 }
 
-size_t MapfileReport::errors() const { return count_of(*this, Severity::kError); }
-size_t MapfileReport::warnings() const { return count_of(*this, Severity::kWarning); }
-size_t NodeinfoReport::errors() const { return count_of(*this, Severity::kError); }
-size_t NodeinfoReport::warnings() const { return count_of(*this, Severity::kWarning); }
-
-// ---------------------------------------------------------------------------
-// Map files
-// ---------------------------------------------------------------------------
 
 namespace {
 
@@ -446,10 +429,6 @@ MapfileReport check_mapfile_text(std::string_view text, const MapContext &ctx) {
                      [](const Finding &a, const Finding &b) { return a.line < b.line; });
     return report;
 }
-
-// ---------------------------------------------------------------------------
-// Node information file
-// ---------------------------------------------------------------------------
 
 namespace {
 

@@ -86,8 +86,6 @@ struct MapfileReport {
     std::vector<MapEntry> entries;         // in file order
     std::vector<std::string> parsed_only;  // mechanisms whose lines were parsed only
     size_t lines = 0;                      // lines of the file (a final line without LF counts)
-    size_t errors() const;
-    size_t warnings() const;
 };
 
 MapfileReport check_mapfile_text(std::string_view text, const MapContext &ctx);
@@ -108,8 +106,6 @@ struct NodeinfoReport {
     std::vector<NodeHost> hosts;  // what the trees would hold (first record wins), when loads
     size_t records = 0;
     size_t lines = 0;
-    size_t errors() const;
-    size_t warnings() const;
 };
 
 // Judges node information text as the loader would after appending an LF.

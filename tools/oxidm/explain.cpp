@@ -138,25 +138,23 @@ struct Explanation {
 };
 
 std::string describe(const Verdict &v, bool denial) {
-    auto with_message = [&](const std::string &what) {
-        return v.message.empty() ? what : what + ": " + short_message(v.message);
-    };
+    std::string what;
     switch (v.status) {
         case IDM_OK: break;
-        case IDM_TRANSLATOR_STOP: return with_message("the translator stopped the walk (status 31)");
-        case IDM_TRANSLATOR_REJECT: return with_message("the translator rejected the identity or the line (status 38)");
-        case IDM_TRANSLATOR_REFUSED:
-            return with_message("the translator refused the line (status 39): not tried again until the map "
-                                "files change");
-        default:
-            return fmt::format("the translator answered status {}: the line is passed over this time", v.status);
+        case IDM_TRANSLATOR_STOP: what = "the translator stopped the walk"; break;
+        case IDM_TRANSLATOR_REJECT: what = "the translator rejected the identity or the line"; break;
+        case IDM_TRANSLATOR_REFUSED: what = "the translator refused the line"; break;
+        default: return fmt::format("the translator answered status {}: the line is passed over this time", v.status);
     }
-    if (v.matched) return denial ? "matches: a denial, no local identity granted" : "matches: maps to \"" + v.result + "\"";
-    if (v.check_rule > 0) return with_message("invalid rule");
-    if (v.check_id > 0) return with_message("invalid id");
-    if (v.apply > 0) return with_message("no match");
-    if (v.apply < 0) return "passed over: its rule was found unusable before";
-    return "no match";
+    if (!what.empty())
+        what += fmt::format(" (status {}){}", v.status,
+                            v.status == IDM_TRANSLATOR_REFUSED ? ": not tried again until the map files change" : "");
+    else if (v.matched) return denial ? "matches: a denial, no local identity granted" : "matches: maps to \"" + v.result + "\"";
+    else if (v.check_rule > 0) what = "invalid rule";
+    else if (v.check_id > 0) what = "invalid id";
+    else if (v.apply < 0) return "passed over: its rule was found unusable before";
+    else what = "no match";
+    return v.message.empty() ? what : what + ": " + short_message(v.message);
 }
 
 struct ExplainArgs {
