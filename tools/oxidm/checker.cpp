@@ -592,6 +592,7 @@ NodeinfoReport check_nodeinfo_text(std::string_view raw) {
     if (r.status == 0) {
         report.hosts = std::move(first.hosts);
     } else if (r.status == Collector::kOverBudget) {
+        r.line = std::min(r.line, std::max<size_t>(report.lines, 1));  // the end of the text, past its last LF
         report.loads = false;
         report.first_error_line = r.line;
         report.findings.push_back(

@@ -212,6 +212,10 @@ Result run_explain(const Options &o, ExplainArgs &a) {
     Result r;
     r.json["mechanism"] = a.mechanism;
     r.json["identity"] = a.identity;
+    if (a.mechanism.empty() || a.identity.empty()) {
+        r.fail("usage", "explain: MECH and IDENTITY must not be empty");
+        return r;
+    }
     if (std::string e = unreadable_config({kLocalMap, kVarGlobalMap, kOptGlobalMap}); !e.empty()) {
         r.fail("explain", e);
         return r;

@@ -18,6 +18,12 @@ Result run_map(const Options &o, const MapArgs &a) {
     Result r;
     r.json["mechanism"] = a.mechanism;
     r.json["results"] = Json::array();
+    // An empty text would reach the library only to come back as a bad
+    // parameter with its address.
+    if (a.mechanism.empty() || std::count(a.identities.begin(), a.identities.end(), "") > 0) {
+        r.fail("usage", "map: MECH and IDENTITY must not be empty");
+        return r;
+    }
     if (std::string e = unreadable_config({kLocalMap, kVarGlobalMap, kOptGlobalMap}); !e.empty()) {
         r.fail("map", e);
         return r;
