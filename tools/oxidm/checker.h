@@ -1,17 +1,10 @@
-// The checkers of `oxidm check` and `oxidm install`: map files and the node
-// information file, judged as libox_idm judges them.  The verdicts are the
-// library's own: its line judge (idm::mapfile::judge_line), the mechanism's
-// translator followed by the library's rule check
-// (idm__native_check_rule), its one-wildcard matcher (idm::wildcard_match)
-// and its node file parser with its memory bound (idm::clmap).  This module
-// walks the text the way the library's readers do and adds what an
-// administrator wants to know besides: warnings.
-//
-// Built into the private shared object liboxidm-check, which carries its
-// own hidden copy of the library's internals: the command keeps talking to
-// the shipped libox_idm for every answer.  Nothing here touches the
-// library's state (no translator list, no trees); the rule check reports
-// through libox_cu like any caller's would.
+// The checkers of `oxidm check` and `oxidm install`.  The verdicts are the
+// library's own: its line judge, the mechanism's translator followed by the
+// library's rule check, its one-wildcard matcher, its node file parser and
+// memory bound; this module walks the text as the library's readers do and
+// adds warnings.  Built into liboxidm-check with a hidden copy of the
+// library's internals (tools/CMakeLists.txt); nothing here touches the
+// library's state, and the rule check reports through libox_cu.
 #ifndef OXIDM_TOOL_CHECKER_H
 #define OXIDM_TOOL_CHECKER_H
 
@@ -36,8 +29,6 @@ struct Finding {
     std::string code;     // short stable tag, e.g. "invalid-rule"
     std::string message;  // one sentence
 };
-
-// ---- map files ----
 
 // A mechanism's routines, as registered with the library.
 struct Translator {
@@ -89,8 +80,6 @@ struct MapfileReport {
 };
 
 MapfileReport check_mapfile_text(std::string_view text, const MapContext &ctx);
-
-// ---- node information file ----
 
 struct NodeHost {
     std::string key;  // as written
