@@ -164,15 +164,11 @@ struct ExplainArgs {
 };
 
 bool explain_wants(int id) {
-    switch (id) {
-        case tp::kTestFilesState: case tp::kParseFile: case tp::kParseLine: case tp::kEntriesInvalidLine:
-        case tp::kEntriesNewEntry: case tp::kDumpRule: case tp::kDumpId: case tp::kDumpToken:
-        case tp::kDumpRuleMapping: case tp::kCheckRuleExitData: case tp::kCheckIdExitData: case tp::kApplyMatched:
-        case tp::kApplyResult: case tp::kApplyExitData:
-            return true;
-        default:
-            return false;
-    }
+    static constexpr tp::Id kRead[] = {tp::kTestFilesState, tp::kParseFile, tp::kParseLine, tp::kEntriesInvalidLine,
+                                       tp::kEntriesNewEntry, tp::kDumpRule, tp::kDumpId, tp::kDumpToken,
+                                       tp::kDumpRuleMapping, tp::kCheckRuleExitData, tp::kCheckIdExitData,
+                                       tp::kApplyMatched, tp::kApplyResult, tp::kApplyExitData};
+    return std::find(std::begin(kRead), std::end(kRead), id) != std::end(kRead);
 }
 
 // Line `i` of the explanation as JSON.
