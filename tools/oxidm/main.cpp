@@ -99,7 +99,10 @@ int main(int argc, char **argv) {
     CLI::App app{"", "oxidm"};
     CommandList commands;
     build_cli(app, o, commands);
-    Command c = parse(app, commands, {argv + 1, argv + argc});
+    std::vector<std::string> args(argv + 1, argv + argc);
+    Command c = parse(app, commands, args);
+    // --version ends the parse where it stands: a --json after it counts too.
+    o.json = o.json || std::find(args.begin(), std::find(args.begin(), args.end(), "--"), "--json") != args.end();
     Result r;
     std::string error;
     if (c.app != nullptr && !o.root.empty() && !c.own_root) error = enter_root(o.root);  // before any thread exists
