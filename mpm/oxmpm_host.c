@@ -168,9 +168,10 @@ EXPORT int32_t oxmpm_host_register(void) {
 }
 
 #ifdef OXMPM_SHARED_OBJECT
-/* The entry a program that loads this object by path finds (oxmpm_plugin.h).
+/* The entry a program that loads this object by path calls (oxmpm_plugin.h).
  * Only the shared object has it: the archives of both samples link together. */
-OXMPM_PLUGIN_EXPORT const struct oxmpm_plugin oxmpm_plugin = {OXMPM_PLUGIN_VERSION, mnemonic,
-                                                              "user@host (host names without regard to case)",
-                                                              oxmpm_host_translate, oxmpm_host_cleanup};
+static const struct oxmpm_plugin entry = {OXMPM_PLUGIN_VERSION, mnemonic,
+                                          "user@host (host names without regard to case)", oxmpm_host_translate,
+                                          oxmpm_host_cleanup};
+OXMPM_PLUGIN_EXPORT const struct oxmpm_plugin *oxmpm_plugin_entry(void) { return &entry; }
 #endif

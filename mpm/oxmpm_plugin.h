@@ -2,16 +2,18 @@
  * oxmpm_plugin.h - how a mechanism plug-in (MPM) makes itself known to a
  * program that loads it by path, such as `oxidm --plugin PATH`.
  *
- * A plug-in shared object exports one data symbol, OXMPM_PLUGIN_SYMBOL
- * ("oxmpm_plugin"), of type `const struct oxmpm_plugin`, with C linkage and
- * default visibility:
+ * A plug-in shared object exports one function, OXMPM_PLUGIN_SYMBOL
+ * ("oxmpm_plugin_entry"), with C linkage and default visibility, that
+ * returns its description:
  *
- *     OXMPM_PLUGIN_EXPORT const struct oxmpm_plugin oxmpm_plugin = {
- *         OXMPM_PLUGIN_VERSION, "mymech", "user:domain",
- *         mymech_translate, mymech_cleanup};
+ *     static const struct oxmpm_plugin entry = {
+ *         OXMPM_PLUGIN_VERSION, "mymech", "user:domain", mymech_translate, mymech_cleanup};
+ *     OXMPM_PLUGIN_EXPORT const struct oxmpm_plugin *oxmpm_plugin_entry(void) { return &entry; }
  *
- * The loader opens the object with dlopen(RTLD_NOW | RTLD_LOCAL), looks the
- * symbol up, checks the version and that every field but `summary` is set,
+ * (A function, not a data symbol: a program may link several plug-ins, and
+ * their entries must not be one object defined twice.)  The loader opens the
+ * object with dlopen(RTLD_NOW | RTLD_LOCAL), calls the entry, checks the
+ * version and that every field but `summary` is set,
  * and registers `translate` and `cleanup` under `mnemonic` itself (with
  * sec_idm_register_translator).  Nothing must run at load time: no
  * constructor, no registration of its own.  One object describes one
@@ -28,7 +30,7 @@
 extern "C" {
 #endif
 
-#define OXMPM_PLUGIN_SYMBOL "oxmpm_plugin"
+#define OXMPM_PLUGIN_SYMBOL "oxmpm_plugin_entry"
 #define OXMPM_PLUGIN_VERSION 1u
 #define OXMPM_PLUGIN_EXPORT __attribute__((visibility("default")))
 
@@ -39,6 +41,9 @@ struct oxmpm_plugin {
     idm_translator_routine translate;  /* fills a rule and an id */
     idm_cleanup_routine cleanup;       /* releases what translate filled */
 };
+
+/* The entry every plug-in defines. */
+typedef const struct oxmpm_plugin *(*oxmpm_plugin_entry_routine)(void);
 
 #ifdef __cplusplus
 }

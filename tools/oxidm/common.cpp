@@ -100,11 +100,12 @@ bool load_plugins(const Options &o, std::string &error) {
     for (const std::string &path : o.plugins) {
         // A plug-in is named by its path only, never searched for.
         void *handle = dlopen((path.find('/') == std::string::npos ? "./" + path : path).c_str(), RTLD_NOW | RTLD_LOCAL);
-        auto *entry = handle ? static_cast<const oxmpm_plugin *>(dlsym(handle, OXMPM_PLUGIN_SYMBOL)) : nullptr;
+        auto call = handle ? reinterpret_cast<oxmpm_plugin_entry_routine>(dlsym(handle, OXMPM_PLUGIN_SYMBOL)) : nullptr;
+        const oxmpm_plugin *entry = call ? call() : nullptr;
         if (handle == nullptr)
             error = dlerror();
         else if (entry == nullptr)
-            error = fmt::format("{}: no \"{}\" symbol: not a mechanism plug-in (see oxidm(1))", path, OXMPM_PLUGIN_SYMBOL);
+            error = fmt::format("{}: no \"{}\" entry: not a mechanism plug-in (see oxidm(1))", path, OXMPM_PLUGIN_SYMBOL);
         else if (entry->version != OXMPM_PLUGIN_VERSION || entry->mnemonic == nullptr || entry->mnemonic[0] == '\0' ||
                  entry->translate == nullptr || entry->cleanup == nullptr)
             error = fmt::format("{}: its {} is not version {} or lacks a mnemonic or a routine", path,
