@@ -31,6 +31,7 @@ install(TARGETS ox_idm ox_cu ox_tr ox_mss
 install(FILES ${PROJECT_SOURCE_DIR}/include/oxidm.h ${PROJECT_SOURCE_DIR}/mpm/oxmpm_host.h
               ${PROJECT_SOURCE_DIR}/mpm/oxmpm_principal.h ${PROJECT_SOURCE_DIR}/platform/cu/ox_cu.h
               ${PROJECT_SOURCE_DIR}/platform/tr/ox_tr.h ${PROJECT_SOURCE_DIR}/platform/mss/ox_mss.h
+              ${PROJECT_SOURCE_DIR}/mpm/oxmpm_plugin.h
         DESTINATION ${CMAKE_INSTALL_INCLUDEDIR} COMPONENT development)
 install(TARGETS oxmpm_host oxmpm_principal LIBRARY DESTINATION ${OXIDM_INSTALL_MPMDIR} COMPONENT runtime)
 

@@ -14,6 +14,7 @@
  */
 #define _DEFAULT_SOURCE /* explicit_bzero */
 #include "oxmpm_host.h"
+#include "oxmpm_plugin.h"
 
 #include <stddef.h>
 #include <stdlib.h>
@@ -165,3 +166,12 @@ EXPORT int32_t oxmpm_host_cleanup(idm_rule *rule, idm_id *id) {
 EXPORT int32_t oxmpm_host_register(void) {
     return sec_idm_register_translator(IDM_MAPPING_NATIVE, mnemonic, oxmpm_host_translate, oxmpm_host_cleanup);
 }
+
+#ifdef OXMPM_SHARED_OBJECT
+/* The entry a program that loads this object by path calls (oxmpm_plugin.h).
+ * Only the shared object has it: the archives of both samples link together. */
+static const struct oxmpm_plugin entry = {OXMPM_PLUGIN_VERSION, mnemonic,
+                                          "user@host (host names without regard to case)", oxmpm_host_translate,
+                                          oxmpm_host_cleanup};
+OXMPM_PLUGIN_EXPORT const struct oxmpm_plugin *oxmpm_plugin_entry(void) { return &entry; }
+#endif

@@ -13,6 +13,7 @@
  */
 #define _DEFAULT_SOURCE /* explicit_bzero */
 #include "oxmpm_principal.h"
+#include "oxmpm_plugin.h"
 
 #include <stddef.h>
 #include <stdlib.h>
@@ -163,3 +164,11 @@ EXPORT int32_t oxmpm_principal_register(void) {
     return sec_idm_register_translator(IDM_MAPPING_NATIVE, mnemonic, oxmpm_principal_translate,
                                        oxmpm_principal_cleanup);
 }
+
+#ifdef OXMPM_SHARED_OBJECT
+/* The entry a program that loads this object by path calls (oxmpm_plugin.h).
+ * Only the shared object has it: the archives of both samples link together. */
+static const struct oxmpm_plugin entry = {OXMPM_PLUGIN_VERSION, mnemonic, "name@REALM or name/instance@REALM",
+                                          oxmpm_principal_translate, oxmpm_principal_cleanup};
+OXMPM_PLUGIN_EXPORT const struct oxmpm_plugin *oxmpm_plugin_entry(void) { return &entry; }
+#endif

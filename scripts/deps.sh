@@ -3,7 +3,7 @@
 # any is missing.  Sourced by the other scripts.  Usage: scripts/deps.sh [extra packages...]
 set -euo pipefail
 need=(cmake ninja-build g++ gcc clang libclang-rt-14-dev libgtest-dev libbenchmark-dev libnss-wrapper python3 binutils pkg-config libkrb5-dev
-      dpkg-dev debhelper lintian)
+      dpkg-dev debhelper lintian libcli11-dev nlohmann-json3-dev libfmt-dev)
 need+=("$@")
 missing=()
 for p in "${need[@]}"; do

@@ -29,4 +29,11 @@ run --root examples cluster any node2 192.0.2.13 unknown.example.org
 run --root examples cluster active node1 node3
 run --root examples check
 run check mapfile examples/mistakes.map
+run map princ alice@EXAMPLE.ORG --root examples --json
+scratch=$(mktemp -d)
+trap 'rm -rf "$scratch"' EXIT
+cp -r examples/var "$scratch/"
+printf 'princ:!*/root@*\nprinc:bob@EXAMPLE.ORG=robert\n' >"$scratch/new.map"
+run --root "$scratch" install global "$scratch/new.map"
+run --root "$scratch" --plugin "$build/mpm/liboxmpm_principal.so" map princ bob@EXAMPLE.ORG
 run --root examples trace --levels API=1 cluster any node1

@@ -6,12 +6,15 @@ settings and with @nobody (run as user 65534; skipped unless root).  {t} is
 a scratch directory holding a copy of the examples ({t}/ex) and the files
 given as "% PATH [MODE|fifo]" followed by their lines as "| " lines (a PATH
 ending in "/" is a directory); paths under {t} are written {t} in outputs.
+{mpm} is the build's directory of sample plug-ins.  Every case runs a second
+time with --json added, and its stdout must be one JSON document.
 
 usage: test_cli.py OXIDM EXAMPLES_DIR
 """
-import os, shlex, shutil, subprocess, sys, tempfile
+import json, os, shlex, shutil, subprocess, sys, tempfile
 
 OXIDM, EXAMPLES = map(os.path.abspath, sys.argv[1:3])
+MPM = os.path.join(os.path.dirname(os.path.dirname(OXIDM)), "mpm")
 GOLDEN = os.path.join(os.path.dirname(os.path.abspath(__file__)), "golden.txt")
 
 
@@ -39,8 +42,8 @@ def make_tree(t, lines):
     os.chmod(t, 0o755)
 
 
-def run(line, t):
-    args = shlex.split(line.replace("{t}", t))
+def run(line, t, extra=()):
+    args = shlex.split(line.replace("{t}", t).replace("{mpm}", MPM)) + list(extra)
     env = dict(os.environ)
     while args and "=" in args[0] and not args[0].startswith("-"):
         key, value = args.pop(0).split("=", 1)
@@ -51,8 +54,10 @@ def run(line, t):
             return None
         cmd = ["setpriv", "--reuid=65534", "--regid=65534", "--clear-groups", OXIDM, *args[1:]]
     p = subprocess.run(cmd, capture_output=True, text=True, env=env, timeout=120)
-    out = [f"> {l}".rstrip() for l in p.stdout.replace(t, "{t}").splitlines()]
-    return out + [f"! {l}".rstrip() for l in p.stderr.replace(t, "{t}").splitlines()] + [f"= {p.returncode}"]
+    if extra:
+        return json.loads(p.stdout)
+    out = [f"> {l}".rstrip() for l in p.stdout.replace(t, "{t}").replace(MPM, "{mpm}").splitlines()]
+    return out + [f"! {l}".rstrip() for l in p.stderr.replace(t, "{t}").replace(MPM, "{mpm}").splitlines()] + [f"= {p.returncode}"]
 
 
 def main():
@@ -72,6 +77,12 @@ def main():
             if got is not None and got != expected:
                 failed.append(command)
                 print(f"FAILED  $ {command}\n  wanted: {expected}\n  got:    {got}")
+        for command, expected in cases:  # after all text runs: cases may write files
+            try:
+                run(command, t, ["--json"])
+            except ValueError as e:
+                failed.append(command + " --json")
+                print(f"FAILED  $ {command} --json: {e}")
     finally:
         shutil.rmtree(t)
     if os.path.exists("/var/ox/cfg") != host_had_cfg:

@@ -28,6 +28,7 @@ libox-idm-dev usr/lib/MA/libox_idm.so
 libox-idm-dev usr/include/oxidm.h
 libox-idm-dev usr/include/oxmpm_host.h
 libox-idm-dev usr/include/oxmpm_principal.h
+libox-idm-dev usr/include/oxmpm_plugin.h
 libox-idm-dev usr/lib/MA/pkgconfig/oxidm.pc
 libox-idm-dev usr/lib/MA/cmake/oxidm/oxidmConfig.cmake
 libox-platform-standins usr/lib/MA/libox_cu.so.1
@@ -97,4 +98,9 @@ in_examples "$work/consumer-cxx/consumer"
 # The installed command finds its libraries and plug-ins by itself.
 env -u LD_LIBRARY_PATH "$root/usr/bin/oxidm" --version | grep -q "1\.0\.0" || fail "installed oxidm --version"
 env -u LD_LIBRARY_PATH "$root/usr/bin/oxidm" mechanisms | grep -q princ || fail "installed oxidm: no princ"
+# The same plug-in source as a loadable object, by path.
+# shellcheck disable=SC2086
+cc -shared -fPIC -DOXMPM_SHARED_OBJECT -o "$work/host.so" "$work/oxmpm_host.c" $flags
+env -u LD_LIBRARY_PATH "$root/usr/bin/oxidm" --plugin "$work/host.so" mechanisms | grep -q "($work/host.so)" ||
+  fail "--plugin of an outside plug-in"
 echo "installed oxidm: ok"

@@ -404,14 +404,6 @@ struct WorkList {
 // the cancellation clean-up) releases them.
 class Builder : Pinned {
   public:
-    // Storing records may make at most this many bytes of tree records per
-    // byte of text (plus a fixed allowance): each record gets its own copy of
-    // its host's cluster list, so a hostile file listing many names and many
-    // clusters in one record would otherwise ask for memory and time growing
-    // with their product.  Real files stay far below it.
-    static constexpr size_t kRecordBytesPerTextByte = 64;
-    static constexpr size_t kRecordBytesAllowance = size_t{16} << 20;
-
     explicit Builder(size_t text_size)
         : record_budget_(text_size * kRecordBytesPerTextByte + kRecordBytesAllowance) {}
     ~Builder() { release(); }

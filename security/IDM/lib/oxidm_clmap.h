@@ -66,6 +66,16 @@ namespace idm::clmap {
 inline constexpr char kNodeInfoPath[] = "/var/ox/cfg/oxsec.nodeinfo";
 inline constexpr int32_t kNotFound = 1;  // host not listed: no failure, nothing reported
 
+// Storing records may make at most this many bytes of tree records per byte
+// of text (plus a fixed allowance): each record gets its own copy of its
+// host's cluster list, so a hostile file listing many names and many
+// clusters in one record would otherwise ask for memory and time growing with
+// their product.  Real files stay far below it.  A tree record of a key
+// costs sizeof(idm_clnode), the key with its NUL, and its cluster list (a
+// pointer and the name with its NUL per cluster).
+inline constexpr size_t kRecordBytesPerTextByte = 64;
+inline constexpr size_t kRecordBytesAllowance = size_t{16} << 20;
+
 // The calling query's hold of idmutex.  A read share from construction; the
 // write hold between promote() and demote(); nothing while either of them
 // waits, since both give up the previous hold first.  The destructor

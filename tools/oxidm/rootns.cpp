@@ -2,7 +2,7 @@
 // mount private, open the source directories (so DIR stays reachable
 // whatever the mounts hide), create missing mount points under an overlay,
 // and bind the sources over the fixed paths.
-#include "oxidm_rootns.h"
+#include "rootns.h"
 
 #include <fcntl.h>
 #include <sched.h>

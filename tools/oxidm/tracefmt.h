@@ -7,8 +7,11 @@
 
 #include <cstdint>
 #include <cstdio>
+#include <functional>
 #include <string>
 #include <vector>
+
+#include <nlohmann/json.hpp>
 
 namespace oxidm_tool {
 
@@ -38,6 +41,13 @@ struct TraceRecord {
 // Records kept by the stand-in from index `from` on.
 std::vector<TraceRecord> captured_records(size_t from = 0);
 size_t captured_count();
+// Hands every record to `sink` as soon as it is written and, with `forget`,
+// drops it from the stand-in's memory, so that no cap on kept records
+// limits a long walk (null: stop).  The sink must not call the library.
+// `wants`, when given, picks the ids the sink is shown (no component set).
+void stream_records(std::function<void(const TraceRecord &)> sink, bool forget, bool (*wants)(int id) = nullptr);
+// Hands over the records written since the last call (streaming only).
+void drain_records();
 
 // Levels of "_SEI" in category order: Error, API, Mapping, Milestone, Diag.
 struct TraceLevels {
@@ -52,8 +62,8 @@ void apply_levels(const TraceLevels &levels);
 std::string decode_item(const TraceRecord &r, size_t j);
 // "  93 sec_idm_map_identity entry data: mnemonic=\"krb5\" ...".
 std::string format_record(const TraceRecord &r);
-// Writes one JSON object per record (used by `trace --json`).
-void records_json(const std::vector<TraceRecord> &records, class Json &json);
+// One JSON object per record (used by `trace --json`).
+nlohmann::ordered_json records_json(const std::vector<TraceRecord> &records);
 
 // Decodes a file written by the stand-in (lines "COMPONENT ID item...");
 // returns the records it understood.  Lines it cannot read are kept as
