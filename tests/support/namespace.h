@@ -12,7 +12,7 @@ inline constexpr const char kOptGlobalMap[] = "/opt/helvo/cfg/oxsec_map.global";
 inline constexpr const char kNodeInfo[] = "/var/ox/cfg/oxsec.nodeinfo";
 
 // Moves the process into a private mount namespace (as root; otherwise a user
-// namespace mapping the caller to root) where /var and /opt are overlays and
+// namespace mapping the caller to root) with a private /tmp, where
 // /var/ox/cfg and /opt/helvo/cfg are empty tmpfs mounts.  Must run before any
 // thread is started.  Returns false when namespaces are not available.
 bool enter_private_namespace();

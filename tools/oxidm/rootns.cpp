@@ -1,7 +1,9 @@
-// Private mount namespace for --root.  Order of work: unshare, make every
-// mount private, open the source directories (so DIR stays reachable
-// whatever the mounts hide), create missing mount points under an overlay,
-// and bind the sources over the fixed paths.
+// Private mount namespaces over the library's fixed configuration
+// directories.  Order of work: unshare, make every mount private, open the
+// source directories (so DIR stays reachable whatever the mounts hide),
+// create missing mount points under an overlay, and mount over the fixed
+// paths.  The scratch file system and the overlay count live for the
+// process: the test programs mount fresh directories many times.
 #include "rootns.h"
 
 #include <fcntl.h>
@@ -103,26 +105,46 @@ std::string make_mount_point(const std::string &target, Scratch &scratch, int &o
     return "";
 }
 
+Scratch g_scratch;
+int g_overlays = 0;
+bool g_fresh = false;  // fresh_config has mounted over the fixed paths
+constexpr const char *kTargets[] = {"/var/ox/cfg", "/opt/helvo/cfg"};
+
 }  // namespace
 
-std::string enter_root(const std::string &dir) {
-    static constexpr const char *kTargets[] = {"/var/ox/cfg", "/opt/helvo/cfg"};
-    if (!is_dir(dir)) return "--root " + dir + ": not a directory";
+std::string enter_namespace(bool as_root) {
     uid_t uid = geteuid();
     gid_t gid = getegid();
     if (uid == 0) {
         if (unshare(CLONE_NEWNS) != 0) return why("unshare(mount namespace)");
     } else {
-        // The caller keeps its own ids inside (mapped to themselves), so the
-        // library's access checks on the files answer as they would outside.
         if (unshare(CLONE_NEWUSER | CLONE_NEWNS) != 0) return why("unshare(user and mount namespace)");
         write_proc("/proc/self/setgroups", "deny");
-        if (!write_proc("/proc/self/uid_map", std::to_string(uid) + " " + std::to_string(uid) + " 1"))
+        const std::string inside_uid = as_root ? "0" : std::to_string(uid), inside_gid = as_root ? "0" : std::to_string(gid);
+        if (!write_proc("/proc/self/uid_map", inside_uid + " " + std::to_string(uid) + " 1"))
             return why("writing uid_map");
-        if (!write_proc("/proc/self/gid_map", std::to_string(gid) + " " + std::to_string(gid) + " 1"))
+        if (!write_proc("/proc/self/gid_map", inside_gid + " " + std::to_string(gid) + " 1"))
             return why("writing gid_map");
     }
     if (mount(nullptr, "/", nullptr, MS_REC | MS_PRIVATE, nullptr) != 0) return why("making mounts private");
+    return "";
+}
+
+std::string fresh_config() {
+    for (const char *target : kTargets) {
+        if (std::string e = make_mount_point(target, g_scratch, g_overlays); !e.empty()) return e;
+        if (g_fresh) umount2(target, MNT_DETACH);
+        if (mount("tmpfs", target, "tmpfs", 0, "mode=0755") != 0) return why(std::string("tmpfs on ") + target);
+    }
+    g_fresh = true;
+    return "";
+}
+
+std::string enter_root(const std::string &dir) {
+    if (!is_dir(dir)) return "--root " + dir + ": not a directory";
+    // The caller keeps its own ids inside (mapped to themselves), so the
+    // library's access checks on the files answer as they would outside.
+    if (std::string e = enter_namespace(false); !e.empty()) return e;
 
     // Sources opened inside the new namespace (a bind needs a source of its
     // own namespace) and before any overlay, so that none can hide them.
@@ -135,16 +157,14 @@ std::string enter_root(const std::string &dir) {
         if (!present[i] && errno != ENOENT) return why(src);
     }
 
-    Scratch scratch;
-    int overlays = 0;
     for (int i = 0; i < 2; ++i) {
-        if (std::string e = make_mount_point(kTargets[i], scratch, overlays); !e.empty()) return e;
+        if (std::string e = make_mount_point(kTargets[i], g_scratch, g_overlays); !e.empty()) return e;
         std::string source;
         if (present[i]) {
             source = fd_path(sources[i].fd);
         } else {
             std::string error;
-            source = scratch.dir("empty" + std::to_string(i), error);
+            source = g_scratch.dir("empty" + std::to_string(i), error);
             if (!error.empty()) return error;
         }
         if (mount(source.c_str(), kTargets[i], nullptr, MS_BIND | MS_REC, nullptr) != 0)
