@@ -1,6 +1,6 @@
 // Rules against ids: the one-wildcard matcher, the rule check and the rule
-// application swept against the reference model (reference.h), the reports of
-// a failed application in the order the checks run, and the rule cache.
+// application swept against the reference model (reference.h), and the
+// reports of a failed application in the order the checks run.
 #include <string>
 #include <vector>
 
@@ -161,28 +161,6 @@ TEST(NatmapRules, FailedApplicationReportsTheFirstFailingCheck) {
         EXPECT_EQ(oxtest::trace_records().back().text(7), l.line);
         idm__release_buffer(&result);
     }
-}
-
-Strs g_cleanups;
-int32_t recording_cleanup(idm_rule *rule, idm_id *) { return g_cleanups.push_back(rule->rgy), 0; }
-
-TEST(NatmapRules, CacheKeepsCopiesInOrderAndReleasesThemThroughTheCleanup) {
-    idm_translator t{};
-    idm_mapfile_entry entries[25]{};
-    Strs names(25);
-    for (int i = 0; i < 25; ++i) {
-        names[i] = "r" + std::to_string(i);
-        idm_rule rule{static_cast<uint32_t>(i), nullptr, names[i].data(), 0, nullptr, nullptr};
-        ASSERT_EQ(idm__native_cache_rule(&t, &entries[i], &rule), 0);
-        EXPECT_EQ(entries[i].rule_index, i + 1);
-    }
-    ASSERT_EQ(t.rule_count, 25);
-    EXPECT_EQ(t.rules[13].rule_state, 13u);
-    idm__native_release_rule_list(recording_cleanup, 0, t.rules);
-    idm__native_release_rule_list(recording_cleanup, 3, nullptr);
-    EXPECT_TRUE(g_cleanups.empty());
-    idm__native_release_rule_list(recording_cleanup, 25, t.rules);  // and frees the array (ASan)
-    EXPECT_EQ(g_cleanups, names);
 }
 
 }  // namespace
