@@ -43,11 +43,14 @@ struct Actor {
 // (to D) is ordered op and then has it ('>') or sleeps on readers_ok ('R')
 // or writer_ok ('W'); "A>" A's order completes; "A." A still waits; "Ac" A
 // is cancelled while it waits; "*U" the actor holding the write hold
-// releases it; "=h,w" the counters become lock_count h, waiting_writers w.
+// releases it; "Mz" the test thread's read hold ends without waking anyone
+// (as when the writer it wakes is cancelled at once); "=h,w" the counters
+// become lock_count h, waiting_writers w.
 const char *const kScenarios[][2] = {
     {"a waiting writer holds back new readers and goes first",
      "Mr Mr AwW BrR =2,1 Mu =1,1 A. Mu A> =-1,0 B. AU B> =1,0 Bu =0,0"},
     {"a cancelled waiting writer releases the readers it held back", "Mr Mr AwW BrR Ac B> =3,0 Mu Mu Bu =0,0"},
+    {"a writer cancelled as the last reader leaves passes its wake-up on to the readers", "Mr AwW CrR Mz Ac C> =1,0 Cu =0,0"},
     {"a cancelled waiting reader leaves the counters alone", "Mw ArR Ac =-1,0 Mt- MU =0,0 Mt+ =-1,0 MU Mr Mt- Mu"},
     {"a leaving writer wakes every reader when no writer waits", "Mw ArR BrR CrR MU A> B> C> =3,0 Au Bu Cu =0,0"},
     {"a leaving writer passes the lock to one waiting writer",
@@ -77,6 +80,10 @@ TEST(Lock, Scenarios) {
                 ASSERT_TRUE(eventually([&] { return threads::counts(lock) == want; }));
             } else if (step[1] == 't') {  // "Mt+", "Mt-": the try-lock takes the write hold, or fails
                 EXPECT_EQ(sec__trylock_write(&lock), step[2] == '+' ? 0 : -1);
+            } else if (step == "Mz") {  // a read hold ends; its wake-up is lost with a writer being cancelled
+                pthread_mutex_lock(&lock.mutex);
+                --lock.lock_count;
+                pthread_mutex_unlock(&lock.mutex);
             } else if (step[0] == 'M') {
                 run(&lock, step[1]);
             } else if (step == "*U") {

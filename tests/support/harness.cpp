@@ -87,12 +87,6 @@ std::vector<TraceRecord> trace_records() {
     return out;
 }
 
-std::vector<int> trace_ids() {
-    std::vector<int> ids;
-    for (const TraceRecord &r : trace_records()) ids.push_back(r.id);
-    return ids;
-}
-
 void set_trace_levels(unsigned char error, unsigned char api, unsigned char mapping, unsigned char milestone,
                       unsigned char diag) {
     const unsigned char levels[5] = {error, api, mapping, milestone, diag};

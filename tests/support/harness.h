@@ -58,7 +58,6 @@ struct TraceRecord {
     std::string text(size_t j) const;  // without the NUL
 };
 std::vector<TraceRecord> trace_records();
-std::vector<int> trace_ids();
 // Levels of "_SEI": Error, API, Mapping, Milestone, Diag.
 void set_trace_levels(unsigned char error, unsigned char api, unsigned char mapping, unsigned char milestone,
                       unsigned char diag);
