@@ -244,36 +244,4 @@ TEST_F(TracePoints, RoutineEndRecordsTheNameAndTheStatus) {
     }
 }
 
-// The dumps of a rule and an id: every field, "<null>" for a missing text,
-// one record per token, the mapping last.
-TEST_F(TracePoints, DumpsOfARuleAndAnIdShowEveryFieldAndNullAsItsText) {
-    char alice[] = "alice", star[] = "*", guest[] = "guest", type[] = "t";
-    char *tokens[] = {alice, star, nullptr};
-    idm_buffer mapping{6, guest}, no_value{0, nullptr};
-    const idm_rule rule{9, type, nullptr, 3, tokens, &mapping}, bare{0, nullptr, type, 0, nullptr, &no_value};
-    const idm_id id{nullptr, type, 2, tokens};
-    using Records = std::vector<std::vector<std::string>>;  // id, then the items as text
-    auto dump = [](auto routine, const auto *what) {
-        oxtest::reset_trace();
-        routine(what);
-        Records out;
-        for (const oxtest::TraceRecord &r : oxtest::trace_records()) {
-            out.push_back({std::to_string(r.id)});
-            for (size_t j = 0; j < r.items.size(); ++j)
-                out.back().push_back(r.items[j].size() == 4 ? std::to_string(r.i32(j)) : r.text(j));
-        }
-        return out;
-    };
-    auto ids = [](int a) { return std::to_string(a); };
-    EXPECT_EQ(dump(idm__trace_native_rule, &rule),
-              (Records{{ids(tp::kDumpRule), "9", "t", "<null>", "3"}, {ids(tp::kDumpToken), "1", "alice"},
-                       {ids(tp::kDumpToken), "2", "*"}, {ids(tp::kDumpToken), "3", "<null>"},
-                       {ids(tp::kDumpRuleMapping), "6", "guest"}}));
-    EXPECT_EQ(dump(idm__trace_native_rule, &bare),
-              (Records{{ids(tp::kDumpRule), "0", "<null>", "t", "0"}, {ids(tp::kDumpRuleMapping), "0", "<null>"}}));
-    EXPECT_EQ(dump(idm__trace_native_id, &id), (Records{{ids(tp::kDumpId), "<null>", "t", "2"},
-                                                        {ids(tp::kDumpToken), "1", "alice"}, {ids(tp::kDumpToken), "2", "*"}}));
-    EXPECT_TRUE(dump(idm__trace_native_id, static_cast<const idm_id *>(nullptr)).empty());
-}
-
 }  // namespace
