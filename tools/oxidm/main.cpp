@@ -27,7 +27,10 @@ Command says(const char *key, std::string text, bool error = false) {
         else r.json[key] = text;
         return r;
     };
-    return {nullptr, run, [key](const Json &j) { fmt::print("{}", j[key].get<std::string>()); }};
+    return {nullptr, run, [key](const Json &j) {
+                const std::string &t = j[key].get_ref<const std::string &>();
+                fmt::print("{}{}", t, t.ends_with('\n') ? "" : "\n");
+            }};
 }
 
 }  // namespace
@@ -38,7 +41,7 @@ void build_cli(CLI::App &app, Options &o, CommandList &out) {
     app.footer("Exit status: 0 an answer, 1 no answer (no mapping granted, host not listed, errors in a checked\n"
                "file), 2 an error or bad usage (the message on stderr; with --json in the document).  See oxidm(1).");
     app.require_subcommand(0, 1);
-    app.set_version_flag("--version", "oxidm " OXIDM_VERSION "\n");
+    app.set_version_flag("--version", "oxidm " OXIDM_VERSION);
     app.add_flag("--json", o.json, "machine-readable output: one JSON document on stdout");
     app.add_option("--root", o.root, "answer as if DIR/var/ox/cfg and DIR/opt/helvo/cfg were the live directories")
         ->type_name("DIR");
