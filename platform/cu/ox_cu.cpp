@@ -10,6 +10,7 @@
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
+#include <ctime>
 #include <fcntl.h>
 #include <mutex>
 #include <pthread.h>
@@ -66,6 +67,17 @@ struct ThreadErrors {
 };
 
 thread_local ThreadErrors t_errors;
+
+// The address of the thread's block, in the static TLS area (eight bytes,
+// which a library loaded with dlopen still finds room for there): one load
+// where reaching the block itself takes a call.
+__attribute__((tls_model("initial-exec"))) thread_local ThreadErrors *t_self = nullptr;
+
+inline ThreadErrors &errors() {
+    ThreadErrors *p = t_self;
+    if (__builtin_expect(p == nullptr, 0)) t_self = p = &t_errors;
+    return *p;
+}
 
 // Texts that did not fit a record's inline space, and the default text of an
 // error made current again from a handle (touched only on those paths).
@@ -142,11 +154,36 @@ __attribute__((noinline)) void spill_text(Record &r, const char *s, size_t n) {
 }
 
 // Appends `s` with its NUL to the record's texts; returns where it starts.
-inline uint32_t keep_text(Record &r, const char *s) {
-    size_t n = std::strlen(s) + 1;
-    uint32_t at = r.used;
-    if (!r.spilled && at + n <= sizeof r.texts) std::memcpy(r.texts + at, s, n);
-    else spill_text(r, s, n);
+// Inserts are short: copying eight bytes at a time while looking for the NUL
+// beats a length scan and a copy call.  A word is read only where it cannot
+// cross into the next page, so reading past the NUL touches nothing the
+// text's own page does not hold (hence no address-sanitizer check here).
+__attribute__((no_sanitize("address"))) inline uint32_t keep_text(Record &r, const char *s) {
+    const uint32_t at = r.used;
+    if (!r.spilled) {
+        char *d = r.texts + at;
+        const char *const end = r.texts + sizeof r.texts;
+        const char *c = s;
+        while (end - d >= 8 && (reinterpret_cast<uintptr_t>(c) & 4095) <= 4096 - 8) {
+            uint64_t w;
+            std::memcpy(&w, c, 8);
+            std::memcpy(d, &w, 8);
+            const uint64_t nul = (w - 0x0101010101010101ull) & ~w & 0x8080808080808080ull;
+            if (nul != 0) {  // the lowest flagged byte is the first NUL
+                r.used = static_cast<uint32_t>(d - r.texts) + (__builtin_ctzll(nul) >> 3) + 1;
+                return at;
+            }
+            c += 8;
+            d += 8;
+        }
+        for (; d != end; ++c)
+            if ((*d++ = *c) == '\0') {
+                r.used = static_cast<uint32_t>(d - r.texts);
+                return at;
+            }
+    }
+    const size_t n = std::strlen(s) + 1;
+    spill_text(r, s, n);
     r.used = at + static_cast<uint32_t>(n);
     return at;
 }
@@ -234,7 +271,7 @@ std::atomic<int64_t> g_clock{0};
 extern "C" int cu_set_error_1(int status, int reserved, const char *catalog, int set, int msgno,
                               const char *deftext, ...) {
     if (deftext == nullptr) deftext = "";
-    ThreadErrors &te = t_errors;
+    ThreadErrors &te = errors();
     const TypeSlot &slot = types_of(te, deftext);
     Record &r = begin_record(te, status, reserved, catalog, set, msgno, deftext);
     r.count = slot.count;
@@ -309,7 +346,22 @@ extern "C" int cu_gettimeofday_1(struct timeval *tv, void *tz) {
         tv->tv_usec = 0;
         return 0;
     }
-    return gettimeofday(tv, static_cast<struct timezone *>(tz)) == 0 ? 0 : errno;
+    if (tz != nullptr) return gettimeofday(tv, static_cast<struct timezone *>(tz)) == 0 ? 0 : errno;
+    // The coarse clock, read without the time-stamp counter, which is slow
+    // in a virtual machine (the library reads the clock once per map file
+    // line).  It lags the precise clock by less than one tick, so its second
+    // is the precise one's unless it is within a tick of the next second;
+    // there the precise clock is read.
+    static const long tick_ns = [] {
+        struct timespec res;
+        return clock_getres(CLOCK_REALTIME_COARSE, &res) == 0 && res.tv_sec == 0 ? res.tv_nsec : 1'000'000'000L;
+    }();
+    struct timespec ts;
+    if (clock_gettime(CLOCK_REALTIME_COARSE, &ts) != 0 || ts.tv_nsec >= 1'000'000'000L - tick_ns)
+        return gettimeofday(tv, nullptr) == 0 ? 0 : errno;
+    tv->tv_sec = ts.tv_sec;
+    tv->tv_usec = static_cast<suseconds_t>(ts.tv_nsec / 1000);
+    return 0;
 }
 
 extern "C" int cu_8bit_strncasecmp_posix_1(const char *s1, const char *s2, size_t n) {
