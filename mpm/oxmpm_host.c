@@ -140,30 +140,36 @@ static int32_t fill_rule(const idm_mapfile_entry *entry, idm_rule *rule) {
     return ST_OK;
 }
 
-/* The id of a plain user@host in the thread's small block: the text is
- * copied whole, its '@' becomes the user's NUL and the host is folded in
- * place.  0 when done; -1 when the block is taken, the text does not fit or
- * is anything but a plain user@host (fill_id then takes the general path,
- * which also gives the status of a bad one). */
+/* The id of a plain user@host in the thread's small block, copied in one
+ * pass: the user as written, its NUL, the host folded.  0 when done; -1
+ * when the block is taken, the text does not fit or is anything but a plain
+ * user@host (fill_id then takes the general path, which also gives the
+ * status of a bad one). */
 static int fill_id_small(const char *network_id, idm_id *id) {
     struct small_block *sm = &small;
     __asm__("" : "+r"(sm)); /* one thread-local look-up, not one per use */
     if (__atomic_load_n(&sm->in_use, __ATOMIC_ACQUIRE)) return -1;
-    size_t n = strlen(network_id);
-    if (n >= SMALL_TEXT) return -1;
-    const char *at = memchr(network_id, '@', n);
-    if (at == NULL || at == network_id || at[1] == '\0') return -1;
-    size_t user_len = (size_t)(at - network_id);
-    if (memchr(at + 1, '@', n - user_len - 1) != NULL) return -1;
     struct block *b = (struct block *)(void *)sm->bytes;
-    __asm__("" : "+r"(n)); /* a short copy: the library call, not an inline string move */
-    memcpy(b->text, network_id, n + 1);
-    b->text[user_len] = '\0';
-    char *host = b->text + user_len + 1;
-    for (char *c = host; *c != '\0'; ++c)
-        *c = (char)(*c + ((unsigned char)(*c - 'A') < 26u ? 'a' - 'A' : 0));
+    char *t = b->text;
+    char *const last = b->text + SMALL_TEXT - 1; /* room for the last NUL */
+    const char *s = network_id;
+    for (;; ++s) {
+        if (*s == '@') break;
+        if (*s == '\0' || t == last) goto fail;
+        *t++ = *s;
+    }
+    if (t == b->text) goto fail;
+    *t++ = '\0';
+    char *host = t;
+    for (++s; *s != '\0'; ++s) {
+        unsigned char c = (unsigned char)*s;
+        if (c == '@' || t == last) goto fail;
+        *t++ = (char)(c + ((unsigned char)(c - 'A') < 26u ? 'a' - 'A' : 0));
+    }
+    if (t == host) goto fail;
+    *t++ = '\0';
     sm->in_use = 1;
-    b->size = sizeof(struct block) + n + 1;
+    b->size = (size_t)(t - (char *)b);
     b->small_in_use = &sm->in_use;
     b->tokens[0] = b->text;
     id->rgy = host;
@@ -171,6 +177,9 @@ static int fill_id_small(const char *network_id, idm_id *id) {
     id->token_cnt = 1;
     id->tokens = b->tokens;
     return 0;
+fail:
+    explicit_bzero(b->text, (size_t)(t - b->text));
+    return -1;
 }
 
 static int32_t fill_id(const char *network_id, idm_id *id) {

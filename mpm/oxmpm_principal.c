@@ -143,48 +143,57 @@ static int32_t fill_rule(const idm_mapfile_entry *entry, idm_rule *rule) {
     return ST_OK;
 }
 
-/* The id of a plain name[/instance]@REALM in the thread's small block: the
- * text is copied whole and its '/' and '@' become NULs.  0 when done; -1
- * when the block is taken, the text does not fit or is not a well-formed
- * principal (fill_id then takes the general path, which also gives the
- * status of a bad one). */
+/* The id of a plain name[/instance]@REALM in the thread's small block,
+ * copied in one pass with a NUL after each part.  0 when done; -1 when the
+ * block is taken, the text does not fit or is not a well-formed principal
+ * (fill_id then takes the general path, which also gives the status of a
+ * bad one). */
 static int fill_id_small(const char *network_id, idm_id *id) {
     struct small_block *sm = &small;
     __asm__("" : "+r"(sm)); /* one thread-local look-up, not one per use */
     if (__atomic_load_n(&sm->in_use, __ATOMIC_ACQUIRE)) return -1;
-    size_t n = strlen(network_id);
-    if (n >= SMALL_TEXT) return -1;
-    const char *at = memchr(network_id, '@', n);
-    if (at == NULL || at == network_id || at[1] == '\0') return -1;
-    const size_t at_pos = (size_t)(at - network_id);
-    if (memchr(at + 1, '@', n - at_pos - 1) != NULL) return -1;
-    const char *slash = memchr(network_id, '/', at_pos);
-    size_t slash_pos = 0;
-    if (slash != NULL) {
-        slash_pos = (size_t)(slash - network_id);
-        if (slash_pos == 0 || slash_pos + 1 == at_pos || memchr(slash + 1, '/', at_pos - slash_pos - 1) != NULL)
-            return -1;
-    }
     struct block *b = (struct block *)(void *)sm->bytes;
-    __asm__("" : "+r"(n)); /* a short copy: the library call, not an inline string move */
-    memcpy(b->text, network_id, n + 1);
-    b->text[at_pos] = '\0';
-    b->tokens[1] = NULL;
-    if (slash != NULL) {
-        b->text[slash_pos] = '\0';
-        b->tokens[1] = b->text + slash_pos + 1;
+    char *t = b->text;
+    char *const last = b->text + SMALL_TEXT - 1; /* room for the last NUL */
+    const char *s = network_id;
+    for (; *s != '@' && *s != '/'; ++s) {
+        if (*s == '\0' || t == last) goto fail;
+        *t++ = *s;
     }
+    if (t == b->text) goto fail;
+    *t++ = '\0';
+    b->tokens[1] = NULL;
+    if (*s == '/') {
+        char *instance = t;
+        for (++s; *s != '@'; ++s) {
+            if (*s == '\0' || *s == '/' || t == last) goto fail;
+            *t++ = *s;
+        }
+        if (t == instance) goto fail;
+        *t++ = '\0';
+        b->tokens[1] = instance;
+    }
+    char *realm = t;
+    for (++s; *s != '\0'; ++s) {
+        if (*s == '@' || t == last) goto fail;
+        *t++ = *s;
+    }
+    if (t == realm) goto fail;
+    *t++ = '\0';
     sm->in_use = 1;
-    b->size = sizeof(struct block) + n + 1;
+    b->size = (size_t)(t - (char *)b);
     b->small_in_use = &sm->in_use;
     b->tokens[0] = b->text;
     b->mapping.length = 0;
     b->mapping.value = NULL;
-    id->rgy = b->text + at_pos + 1;
+    id->rgy = realm;
     id->rgy_type = mnemonic;
-    id->token_cnt = slash != NULL ? 2 : 1;
+    id->token_cnt = b->tokens[1] != NULL ? 2 : 1;
     id->tokens = b->tokens;
     return 0;
+fail:
+    explicit_bzero(b->text, (size_t)(t - b->text));
+    return -1;
 }
 
 static int32_t fill_id(const char *network_id, idm_id *id) {
