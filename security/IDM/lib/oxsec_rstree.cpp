@@ -50,6 +50,8 @@ int rst_insert_recurse(rst_tree *tree, rst_node **link, void **object) {
         tree->rst_node_cnt++;
         return 1;
     }
+    __builtin_prefetch(n->left);  // as in sec__rst_find
+    __builtin_prefetch(n->right);
     int r = tree->rst_compare(*object, n->object);
     if (r == 0) {
         *object = n->object;
@@ -115,6 +117,10 @@ int sec__rst_find(rst_tree *tree, void **probe) {
     if (!usable(tree) || probe == nullptr || *probe == nullptr) return -1;
     const rst_node *n = tree->rst_root;
     while (n != nullptr) {
+        // Both children are fetched while the comparison waits for the
+        // object: a level then costs one cache miss instead of two.
+        __builtin_prefetch(n->left);
+        __builtin_prefetch(n->right);
         int r = tree->rst_compare(*probe, n->object);
         if (r == 0) {
             *probe = n->object;
