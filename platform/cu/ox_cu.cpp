@@ -157,17 +157,18 @@ __attribute__((noinline)) void spill_text(Record &r, const char *s, size_t n) {
 // Inserts are short: copying eight bytes at a time while looking for the NUL
 // beats a length scan and a copy call.  A word is read only where it cannot
 // cross into the next page, so reading past the NUL touches nothing the
-// text's own page does not hold (hence no address-sanitizer check here).
-__attribute__((no_sanitize("address"))) inline uint32_t keep_text(Record &r, const char *s) {
+// text's own page does not hold (hence no sanitizer checks here: they would
+// take the bytes past the NUL for a read of someone else's memory).
+using UnalignedWord = uint64_t __attribute__((may_alias, aligned(1)));
+__attribute__((no_sanitize("address", "thread"))) inline uint32_t keep_text(Record &r, const char *s) {
     const uint32_t at = r.used;
     if (!r.spilled) {
         char *d = r.texts + at;
         const char *const end = r.texts + sizeof r.texts;
         const char *c = s;
         while (end - d >= 8 && (reinterpret_cast<uintptr_t>(c) & 4095) <= 4096 - 8) {
-            uint64_t w;
-            std::memcpy(&w, c, 8);
-            std::memcpy(d, &w, 8);
+            const uint64_t w = *reinterpret_cast<const UnalignedWord *>(c);
+            *reinterpret_cast<UnalignedWord *>(d) = w;
             const uint64_t nul = (w - 0x0101010101010101ull) & ~w & 0x8080808080808080ull;
             if (nul != 0) {  // the lowest flagged byte is the first NUL
                 r.used = static_cast<uint32_t>(d - r.texts) + (__builtin_ctzll(nul) >> 3) + 1;
