@@ -280,18 +280,17 @@ extern "C" int cu_set_error_1(int status, int reserved, const char *catalog, int
     va_list ap;
     va_start(ap, deftext);
     for (int i = 0; i < slot.count; ++i) {
-        r.raw[i] = 0;
-        switch (slot.types[i]) {
-        case 's': {
+        const char type = slot.types[i];
+        if (type == 's') {  // the common insert first
             const char *s = va_arg(ap, const char *);
             r.text_at[i] = keep_text(r, s ? s : "(null)");
-            break;
-        }
-        case 'x':  // pointer-sized on purpose: callers pass the offending value itself
+            r.raw[i] = 0;
+        } else if (type == 'x') {  // pointer-sized on purpose: callers pass the offending value itself
             r.raw[i] = va_arg(ap, unsigned long long);
-            break;
-        case 'u': r.raw[i] = va_arg(ap, unsigned); break;
-        default: r.raw[i] = static_cast<unsigned long long>(static_cast<long long>(va_arg(ap, int))); break;
+        } else if (type == 'u') {
+            r.raw[i] = va_arg(ap, unsigned);
+        } else {
+            r.raw[i] = static_cast<unsigned long long>(static_cast<long long>(va_arg(ap, int)));
         }
     }
     va_end(ap);
