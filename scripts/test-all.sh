@@ -1,8 +1,10 @@
 #!/bin/bash
 # Builds and runs every test: the library's lock annotations checked by
 # clang, the whole suite as a plain debug build and under ASan+UBSan, and the
-# concurrency tests under TSan.  Installs missing Debian
-# packages first.  Warnings are errors here.
+# concurrency tests under TSan, the Debian packages (built without their own
+# run of the suite, checked by lintian, unpacked into a scratch root and
+# built against).  Installs missing Debian packages first.  Warnings are
+# errors here.
 set -euo pipefail
 cd "$(dirname "$0")/.."
 scripts/deps.sh
@@ -23,6 +25,8 @@ cmake --build --preset thread-safety -j "$jobs" || status=1
 run_suite debug
 run_suite asan-ubsan
 run_suite tsan
+echo "=== packages: build, lintian, unpacked into a scratch root and built against" >&2
+DEB_BUILD_OPTIONS="nocheck parallel=$jobs" scripts/packages.sh && tests/tool/test_install.sh build/deb . || status=1
 if [[ -x fuzz/run-short.sh ]]; then
   echo "=== fuzz: short runs" >&2
   fuzz/run-short.sh || status=1

@@ -19,10 +19,8 @@
 #include "oxidm_natfile.h"
 
 // The library's stream opening goes through this definition: a test makes
-// it fail with a chosen error number.
-namespace {
+// it fail with a chosen error number (the trace walk uses it too).
 std::atomic<int> g_fdopen_errno{0};
-}
 extern "C" FILE *fdopen(int fd, const char *mode) noexcept {
     if (int e = g_fdopen_errno.load()) {
         errno = e;

@@ -150,6 +150,19 @@ TEST(NatmapRules, FailedApplicationReportsTheFirstFailingCheck) {
     ASSERT_EQ(idm__native_apply_rule(&r.r, &id.id, &result), idm::kOk);
     EXPECT_EQ(oxtest::trace_records().back().text(0), "joe");
     idm__release_buffer(&result);
+    // The matched record shows each side's tokens on one line, cut at 252 characters.
+    const std::string x250(250, 'x'), x300(300, 'x');
+    const struct { Texts tokens; std::string line; } lines[] = {
+        {{"a", "bc"}, "a bc "}, {{x300.c_str(), "b"}, std::string(252, 'x') + "..."}, {{x250.c_str(), "b", "c"}, x250 + " b..."}};
+    oxtest::set_trace_levels(0, 0, 1, 0, 0);
+    for (const auto &l : lines) {
+        Rule rule("m", "r", l.tokens, {true, 2, "g"});
+        Id matched("m", "r", l.tokens);
+        ASSERT_EQ(idm__native_apply_rule(&rule.r, &matched.id, &result), idm::kOk);
+        EXPECT_EQ(oxtest::trace_records().back().text(3), l.line);
+        EXPECT_EQ(oxtest::trace_records().back().text(7), l.line);
+        idm__release_buffer(&result);
+    }
 }
 
 Strs g_cleanups;

@@ -92,7 +92,9 @@ void sec__unlock_write(sec_rwlock *lock) OXIDM_NO_THREAD_SAFETY_ANALYSIS {
 
 void sec__lock_promote(sec_rwlock *lock) OXIDM_NO_THREAD_SAFETY_ANALYSIS {
     pthread_mutex_lock(&lock->mutex);
-    if (lock->lock_count > 0 && --lock->lock_count == 0) pthread_cond_signal(&lock->writer_ok);
+    // The caller's read hold ends here.  No writer is woken for it: were it
+    // the last reader, the caller takes the lock at once, before any other.
+    if (lock->lock_count > 0) --lock->lock_count;
     wait_as_writer(lock);
 }
 
