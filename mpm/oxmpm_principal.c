@@ -114,7 +114,8 @@ static struct block *make_block(const struct principal *p, size_t extra, char **
 }
 
 /* Zeroes the block and frees it, or hands the small block back to its
- * thread (the cleanup may run on another thread than the translation). */
+ * thread (the cleanup may run on another thread than the translation, as
+ * long as the translating thread lives). */
 static void free_block(char **tokens) {
     if (tokens == NULL) return;
     struct block *b = (struct block *)(void *)((char *)tokens - offsetof(struct block, tokens));
