@@ -5,6 +5,8 @@
 // point), idm__trace_categories and null_string (constant in practice).
 // Registration runs once per process under idm__trace_register_once; the
 // component is never unregistered by the library.
+#include <iterator>
+
 #include "oxidm_diag.h"
 
 using namespace idm;
@@ -17,7 +19,7 @@ unsigned char idm__trace_registered = 0;
 const char *null_string = "<null>";
 
 // Category table as libox_tr receives it: number, name, a null field.
-static const tr_category_t idm__trace_categories[5] = {
+static const tr_category_t idm__trace_categories[] = {
     {0, "Error", nullptr}, {1, "API", nullptr}, {2, "Mapping", nullptr},
     {3, "Milestone", nullptr}, {4, "Diag", nullptr},
 };
@@ -27,7 +29,8 @@ static const tr_category_t idm__trace_categories[5] = {
 int idm__trace_register_oxidm(void) {
     cu_error_t *pending = nullptr;
     cu_get_error_1(&pending);
-    int rc = tr_register_component_1(trace::kComponent, idm__trace_detail_levels, idm__trace_categories, 5);
+    int rc = tr_register_component_1(trace::kComponent, idm__trace_detail_levels, idm__trace_categories,
+                                    static_cast<int>(std::size(idm__trace_categories)));
     if (pending != nullptr) cu_pset_error_1(pending);
     return rc;
 }
@@ -49,34 +52,27 @@ int idm__trace_routine_end(const char *name, int32_t status) {
     return 0;
 }
 
+// Each dump records null_string in place of a missing text.
 static void trace_tokens(int32_t count, char *const *tokens) {
-    for (int32_t i = 1; i <= count; ++i) {
-        const char *token = tokens != nullptr ? tokens[i - 1] : nullptr;
-        trace::record_data(tp::kDumpToken, trace::i32(i), trace::text(token != nullptr ? token : null_string));
-    }
+    for (int32_t i = 1; i <= count; ++i)
+        trace::record_data(tp::kDumpToken, trace::i32(i), trace::text(tokens != nullptr ? tokens[i - 1] : nullptr, null_string));
 }
 
 void idm__trace_native_rule(const idm_rule *rule) {
     if (rule == nullptr) return;
-    idm_rule copy = *rule;
-    if (copy.rgy_type == nullptr) copy.rgy_type = const_cast<char *>(null_string);
-    if (copy.rgy == nullptr) copy.rgy = const_cast<char *>(null_string);
-    trace::record_data(tp::kDumpRule, trace::u32(copy.rule_state), trace::text(copy.rgy_type), trace::text(copy.rgy),
-                       trace::i32(copy.token_cnt));
-    trace_tokens(copy.token_cnt, copy.tokens);
-    if (copy.mapping != nullptr) {
-        const char *value = copy.mapping->value != nullptr ? copy.mapping->value : null_string;
-        trace::record_data(tp::kDumpRuleMapping, trace::u32(copy.mapping->length), trace::text(value));
-    }
+    trace::record_data(tp::kDumpRule, trace::u32(rule->rule_state), trace::text(rule->rgy_type, null_string),
+                       trace::text(rule->rgy, null_string), trace::i32(rule->token_cnt));
+    trace_tokens(rule->token_cnt, rule->tokens);
+    if (rule->mapping != nullptr)
+        trace::record_data(tp::kDumpRuleMapping, trace::u32(rule->mapping->length),
+                           trace::text(rule->mapping->value, null_string));
 }
 
 void idm__trace_native_id(const idm_id *id) {
     if (id == nullptr) return;
-    idm_id copy = *id;
-    if (copy.rgy_type == nullptr) copy.rgy_type = const_cast<char *>(null_string);
-    if (copy.rgy == nullptr) copy.rgy = const_cast<char *>(null_string);
-    trace::record_data(tp::kDumpId, trace::text(copy.rgy_type), trace::text(copy.rgy), trace::i32(copy.token_cnt));
-    trace_tokens(copy.token_cnt, copy.tokens);
+    trace::record_data(tp::kDumpId, trace::text(id->rgy_type, null_string), trace::text(id->rgy, null_string),
+                       trace::i32(id->token_cnt));
+    trace_tokens(id->token_cnt, id->tokens);
 }
 
 }  // extern "C"
