@@ -20,7 +20,8 @@ ROWS_FILE (bench/ratios.txt), one row per line, fields separated by '|':
                      NAME@COUNTER (the median of that user counter),
                      =25ns, =100ms (a fixed time budget) or =1e7 (a fixed value),
                      or - (no baseline).
-                     A - B (a difference), N*A (a multiple), N*(A - B).
+                     A - B (a difference), A + B (a sum), N*A (a multiple),
+                     N*(A - B).
   target:            <=X   figure / baseline must be at most X
                      >=X   figure / baseline must be at least X
                      Xx    the figure must be at least X times faster
@@ -107,6 +108,13 @@ def resolve(cell, runs):
             return v, is_time, why
         v *= float(m.group(1))
         return v, is_time, fmt_time(v) if is_time else fmt_value(v)
+    if ' + ' in cell:
+        parts = [resolve(x.strip(), runs) for x in cell.split(' + ')]
+        for v, _, why in parts:
+            if v is None:
+                return None, True, why
+        v = sum(p[0] for p in parts)
+        return v, parts[0][1], fmt_time(v) if parts[0][1] else fmt_value(v)
     if ' - ' in cell:
         parts = [resolve(x.strip(), runs) for x in cell.split(' - ')]
         for v, _, why in parts:

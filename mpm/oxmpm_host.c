@@ -2,21 +2,27 @@
  * oxmpm_host.c - sample MPM "host": translator and cleanup routine for
  * identities user@host.  Syntax and statuses: oxmpm_host.h.
  *
- * Memory: each structure the translator fills owns exactly one heap block,
- * hung on its `tokens` field; the token array, every text and (for a rule)
- * the mapping buffer live inside it, with the block's size stored in front.
- * The cleanup routine therefore needs nothing but that pointer: it zeroes
- * the block (it held identities) and frees it.  `rgy_type` points to
- * the constant mnemonic and is never freed.
+ * Memory: each structure the translator fills owns exactly one block, hung
+ * on its `tokens` field; the token array, every text and (for a rule) the
+ * mapping buffer live inside it, with the block's size and origin stored in
+ * front.  A rule's block is on the heap (libox_idm caches rules).  An id is
+ * translated once per entry walked and released right after, so it goes
+ * into the calling thread's small block when that is free and the id fits,
+ * and onto the heap otherwise.  The cleanup routine therefore needs nothing
+ * but that pointer: it zeroes the block (it held identities) and frees it
+ * or hands the small block back.  `rgy_type` points to the constant mnemonic
+ * and is never freed.
  *
- * The routines keep no state and take no lock, so any number of threads may
- * use them; libox_idm serialises the calls for one mechanism anyway.
+ * The routines take no lock; the only state is each thread's small block,
+ * so any number of threads may use them (libox_idm serialises the calls for
+ * one mechanism anyway).
  */
 #define _DEFAULT_SOURCE /* explicit_bzero */
 #include "oxmpm_host.h"
 #include "oxmpm_plugin.h"
 
 #include <stddef.h>
+#include <stdint.h>
 #include <stdlib.h>
 #include <string.h>
 
@@ -48,43 +54,75 @@ static int split(const char *text, struct parts *p) {
         return 0;
     }
     const char *at = strchr(text, '@');
-    if (at == NULL || at == text || at[1] == '\0' || strchr(at + 1, '@') != NULL) return -1;
+    if (at == NULL || at == text || at[1] == '\0') return -1;
+    size_t host_len = strlen(at + 1);
+    if (memchr(at + 1, '@', host_len) != NULL) return -1;
     p->user = text;
     p->user_len = (size_t)(at - text);
     p->host = at + 1;
-    p->host_len = strlen(at + 1);
+    p->host_len = host_len;
     return 0;
 }
 
 static char *put(char *dst, const char *src, size_t n, int fold) {
-    for (size_t i = 0; i < n; ++i) {
-        char c = src[i];
-        dst[i] = (fold && c >= 'A' && c <= 'Z') ? (char)(c - 'A' + 'a') : c;
+    if (!fold) {
+        memcpy(dst, src, n);
+    } else {
+        for (size_t i = 0; i < n; ++i) {
+            unsigned char c = (unsigned char)src[i];
+            dst[i] = (char)(c + ((unsigned char)(c - 'A') < 26u ? 'a' - 'A' : 0));
+        }
     }
     dst[n] = '\0';
     return dst + n + 1;
 }
 
-/* Heap block behind `tokens`: its size, the token array, the mapping
- * buffer (rules only), then host, user and local name. */
+/* Block behind `tokens`: its size, the `in_use` flag of the thread's small
+ * block when it is that block (NULL for a heap block), the token array, the
+ * mapping buffer (rules only), then the texts. */
 struct block {
     size_t size;
+    unsigned char *small_in_use;
     char *tokens[1];
     idm_buffer mapping;
     char text[];
 };
 
+/* Text bytes of the thread's small block: room for the ids of ordinary
+ * names.  `in_use` is set while an id lives in it. */
+#define SMALL_TEXT 192
+
+struct small_block {
+    unsigned char in_use;
+    _Alignas(struct block) char bytes[sizeof(struct block) + SMALL_TEXT];
+};
+static _Thread_local struct small_block small;
+
 static struct block *new_block(size_t text_size) {
     struct block *b = malloc(sizeof(struct block) + text_size);
-    if (b != NULL) b->size = sizeof(struct block) + text_size;
+    if (b == NULL) return NULL;
+    b->size = sizeof(struct block) + text_size;
+    b->small_in_use = NULL;
     return b;
 }
 
+/* Zeroes the block and frees it, or hands the small block back to its
+ * thread (the cleanup may run on another thread than the translation, as
+ * long as the translating thread lives). */
 static void free_block(char **tokens) {
     if (tokens == NULL) return;
     struct block *b = (struct block *)(void *)((char *)tokens - offsetof(struct block, tokens));
-    explicit_bzero(b, b->size);
-    free(b);
+    unsigned char *small = b->small_in_use;
+    if (small == NULL) {
+        explicit_bzero(b, b->size);
+        free(b);
+        return;
+    }
+    /* The small block is zeroed a word at a time in line (it is short and
+     * word-aligned); the volatile stores are kept like explicit_bzero's. */
+    volatile uint64_t *w = (volatile uint64_t *)(void *)b;
+    for (size_t i = 0, n = (b->size + 7) / 8; i < n; ++i) w[i] = 0;
+    __atomic_store_n(small, 0, __ATOMIC_RELEASE);
 }
 
 static int32_t fill_rule(const idm_mapfile_entry *entry, idm_rule *rule) {
@@ -112,7 +150,50 @@ static int32_t fill_rule(const idm_mapfile_entry *entry, idm_rule *rule) {
     return ST_OK;
 }
 
+/* The id of a plain user@host in the thread's small block, copied in one
+ * pass: the user as written, its NUL, the host folded.  0 when done; -1
+ * when the block is taken, the text does not fit or is anything but a plain
+ * user@host (fill_id then takes the general path, which also gives the
+ * status of a bad one). */
+static int fill_id_small(const char *network_id, idm_id *id) {
+    struct small_block *sm = &small;
+    __asm__("" : "+r"(sm)); /* one thread-local look-up, not one per use */
+    if (__atomic_load_n(&sm->in_use, __ATOMIC_ACQUIRE)) return -1;
+    struct block *b = (struct block *)(void *)sm->bytes;
+    char *t = b->text;
+    char *const last = b->text + SMALL_TEXT - 1; /* room for the last NUL */
+    const char *s = network_id;
+    for (;; ++s) {
+        if (*s == '@') break;
+        if (*s == '\0' || t == last) goto fail;
+        *t++ = *s;
+    }
+    if (t == b->text) goto fail;
+    *t++ = '\0';
+    char *host = t;
+    for (++s; *s != '\0'; ++s) {
+        unsigned char c = (unsigned char)*s;
+        if (c == '@' || t == last) goto fail;
+        *t++ = (char)(c + ((unsigned char)(c - 'A') < 26u ? 'a' - 'A' : 0));
+    }
+    if (t == host) goto fail;
+    *t++ = '\0';
+    sm->in_use = 1;
+    b->size = (size_t)(t - (char *)b);
+    b->small_in_use = &sm->in_use;
+    b->tokens[0] = b->text;
+    id->rgy = host;
+    id->rgy_type = mnemonic;
+    id->token_cnt = 1;
+    id->tokens = b->tokens;
+    return 0;
+fail:
+    explicit_bzero(b->text, (size_t)(t - b->text));
+    return -1;
+}
+
 static int32_t fill_id(const char *network_id, idm_id *id) {
+    if (network_id != NULL && fill_id_small(network_id, id) == 0) return ST_OK;
     struct parts p;
     if (network_id == NULL || split(network_id, &p) != 0) return ST_BAD_ID;
     struct block *b = new_block(p.host_len + 1 + p.user_len + 1);

@@ -3,19 +3,24 @@
  * principal names name[/instance]@REALM.  Syntax and statuses:
  * oxmpm_principal.h.
  *
- * Memory: each structure the translator fills owns exactly one heap block,
- * hung on its `tokens` field; the token array, every text and (for a rule)
- * the mapping buffer live inside it, with the block's size stored in front.
- * The cleanup routine zeroes the block (it held identities) and frees it.
- * `rgy_type` points to the constant mnemonic and is never freed.
+ * Memory: each structure the translator fills owns exactly one block, hung
+ * on its `tokens` field; the token array, every text and (for a rule) the
+ * mapping buffer live inside it, with the block's size and origin stored in
+ * front.  A rule's block is on the heap (libox_idm caches rules).  An id is
+ * translated once per entry walked and released right after, so it goes
+ * into the calling thread's small block when that is free and the id fits,
+ * and onto the heap otherwise.  The cleanup routine zeroes the block (it
+ * held identities) and frees it or hands the small block back.  `rgy_type`
+ * points to the constant mnemonic and is never freed.
  *
- * The routines keep no state and take no lock.
+ * The routines take no lock; the only state is each thread's small block.
  */
 #define _DEFAULT_SOURCE /* explicit_bzero */
 #include "oxmpm_principal.h"
 #include "oxmpm_plugin.h"
 
 #include <stddef.h>
+#include <stdint.h>
 #include <stdlib.h>
 #include <string.h>
 
@@ -56,14 +61,26 @@ static int split(const char *text, struct principal *p) {
     return p->name_len == 0 ? -1 : 0;
 }
 
-/* Heap block behind `tokens`: its size, the token array, the mapping
- * buffer (rules only), then the texts. */
+/* Block behind `tokens`: its size, the `in_use` flag of the thread's small
+ * block when it is that block (NULL for a heap block), the token array, the
+ * mapping buffer (rules only), then the texts. */
 struct block {
     size_t size;
+    unsigned char *small_in_use;
     char *tokens[2];
     idm_buffer mapping;
     char text[];
 };
+
+/* Text bytes of the thread's small block: room for the ids of ordinary
+ * names.  `in_use` is set while an id lives in it. */
+#define SMALL_TEXT 192
+
+struct small_block {
+    unsigned char in_use;
+    _Alignas(struct block) char bytes[sizeof(struct block) + SMALL_TEXT];
+};
+static _Thread_local struct small_block small;
 
 static char *put(char *dst, const char *src, size_t n) {
     memcpy(dst, src, n);
@@ -79,6 +96,7 @@ static struct block *make_block(const struct principal *p, size_t extra, char **
     struct block *b = malloc(size);
     if (b == NULL) return NULL;
     b->size = size;
+    b->small_in_use = NULL;
     char *t = b->text;
     *rgy = t;
     t = put(t, p->realm, p->realm_len);
@@ -97,11 +115,23 @@ static struct block *make_block(const struct principal *p, size_t extra, char **
     return b;
 }
 
+/* Zeroes the block and frees it, or hands the small block back to its
+ * thread (the cleanup may run on another thread than the translation, as
+ * long as the translating thread lives). */
 static void free_block(char **tokens) {
     if (tokens == NULL) return;
     struct block *b = (struct block *)(void *)((char *)tokens - offsetof(struct block, tokens));
-    explicit_bzero(b, b->size);
-    free(b);
+    unsigned char *small_in_use = b->small_in_use;
+    if (small_in_use == NULL) {
+        explicit_bzero(b, b->size);
+        free(b);
+        return;
+    }
+    /* The small block is zeroed a word at a time in line (it is short and
+     * word-aligned); the volatile stores are kept like explicit_bzero's. */
+    volatile uint64_t *w = (volatile uint64_t *)(void *)b;
+    for (size_t i = 0, n = (b->size + 7) / 8; i < n; ++i) w[i] = 0;
+    __atomic_store_n(small_in_use, 0, __ATOMIC_RELEASE);
 }
 
 static int32_t fill_rule(const idm_mapfile_entry *entry, idm_rule *rule) {
@@ -123,7 +153,61 @@ static int32_t fill_rule(const idm_mapfile_entry *entry, idm_rule *rule) {
     return ST_OK;
 }
 
+/* The id of a plain name[/instance]@REALM in the thread's small block,
+ * copied in one pass with a NUL after each part.  0 when done; -1 when the
+ * block is taken, the text does not fit or is not a well-formed principal
+ * (fill_id then takes the general path, which also gives the status of a
+ * bad one). */
+static int fill_id_small(const char *network_id, idm_id *id) {
+    struct small_block *sm = &small;
+    __asm__("" : "+r"(sm)); /* one thread-local look-up, not one per use */
+    if (__atomic_load_n(&sm->in_use, __ATOMIC_ACQUIRE)) return -1;
+    struct block *b = (struct block *)(void *)sm->bytes;
+    char *t = b->text;
+    char *const last = b->text + SMALL_TEXT - 1; /* room for the last NUL */
+    const char *s = network_id;
+    for (; *s != '@' && *s != '/'; ++s) {
+        if (*s == '\0' || t == last) goto fail;
+        *t++ = *s;
+    }
+    if (t == b->text) goto fail;
+    *t++ = '\0';
+    b->tokens[1] = NULL;
+    if (*s == '/') {
+        char *instance = t;
+        for (++s; *s != '@'; ++s) {
+            if (*s == '\0' || *s == '/' || t == last) goto fail;
+            *t++ = *s;
+        }
+        if (t == instance) goto fail;
+        *t++ = '\0';
+        b->tokens[1] = instance;
+    }
+    char *realm = t;
+    for (++s; *s != '\0'; ++s) {
+        if (*s == '@' || t == last) goto fail;
+        *t++ = *s;
+    }
+    if (t == realm) goto fail;
+    *t++ = '\0';
+    sm->in_use = 1;
+    b->size = (size_t)(t - (char *)b);
+    b->small_in_use = &sm->in_use;
+    b->tokens[0] = b->text;
+    b->mapping.length = 0;
+    b->mapping.value = NULL;
+    id->rgy = realm;
+    id->rgy_type = mnemonic;
+    id->token_cnt = b->tokens[1] != NULL ? 2 : 1;
+    id->tokens = b->tokens;
+    return 0;
+fail:
+    explicit_bzero(b->text, (size_t)(t - b->text));
+    return -1;
+}
+
 static int32_t fill_id(const char *network_id, idm_id *id) {
+    if (network_id != NULL && fill_id_small(network_id, id) == 0) return ST_OK;
     struct principal p;
     if (network_id == NULL || split(network_id, &p) != 0) return ST_BAD_ID;
     if (make_block(&p, 0, &id->rgy, &id->token_cnt, &id->tokens) == NULL) return ST_NO_MEMORY;

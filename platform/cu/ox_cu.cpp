@@ -10,17 +10,88 @@
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
+#include <ctime>
 #include <fcntl.h>
 #include <mutex>
 #include <pthread.h>
 #include <sys/stat.h>
 #include <unistd.h>
 #include <set>
-#include <unordered_map>
+#include <algorithm>
 #include <string>
 #include <vector>
 
 namespace {
+
+constexpr int kMaxInserts = 16;       // inserts 1..16 of a text are kept
+constexpr size_t kInlineTexts = 480;  // text inserts, inline
+constexpr size_t kTypeSlots = 64;     // conversion types remembered per thread
+
+// A recorded error, as plain bytes: recording one is a few stores and copies,
+// with no constructor, no formatting and no heap allocation while the text
+// inserts fit `texts`.  The message is put together only when someone reads
+// it (cux_error_text, cux_error_insert).  The catalogue name and the default
+// text are a catalogue's static texts and are kept by address, as passed.
+struct Record {
+    int status;
+    int reserved;
+    int set;
+    int msgno;
+    const char *catalog;                  // as passed; a copy's own after cu_pset_error_1
+    const char *deftext;                  // likewise
+    int count;                            // inserts recorded
+    char types[kMaxInserts];              // 's', 'd', 'x' or 'u' for insert i + 1
+    unsigned long long raw[kMaxInserts];  // integer inserts as passed (0 for texts)
+    uint32_t text_at[kMaxInserts];        // where a text insert starts in the texts
+    uint32_t used;                        // bytes of the texts in use
+    bool spilled;                         // the texts live in the thread's spill string
+    char texts[kInlineTexts];
+};
+
+// Types of the inserts of one default text (texts are static catalogue
+// entries: the address identifies the text).
+struct TypeSlot {
+    const char *deftext;
+    int count;
+    char types[kMaxInserts];
+};
+
+// Everything the recording path touches, in one thread-local block of plain
+// bytes: no guard, no destructor to register.
+struct ThreadErrors {
+    bool pending;
+    unsigned long count;     // cu_set_error_1 calls
+    unsigned long serial;    // changes whenever the current error does
+    Record current;
+    TypeSlot slots[kTypeSlots];
+};
+
+thread_local ThreadErrors t_errors;
+
+// The address of the thread's block, in the static TLS area (eight bytes,
+// which a library loaded with dlopen still finds room for there): one load
+// where reaching the block itself takes a call.
+__attribute__((tls_model("initial-exec"))) thread_local ThreadErrors *t_self = nullptr;
+
+inline ThreadErrors &errors() {
+    ThreadErrors *p = t_self;
+    if (__builtin_expect(p == nullptr, 0)) t_self = p = &t_errors;
+    return *p;
+}
+
+// Texts that did not fit a record's inline space, and the default text of an
+// error made current again from a handle (touched only on those paths).
+thread_local std::string t_spill;
+thread_local std::string t_owned_catalog;
+thread_local std::string t_owned_deftext;
+
+// What the reading calls formatted, for the error of serial `serial`.
+struct Formatted {
+    unsigned long serial = ~0ul;
+    std::string text;
+    std::vector<std::string> inserts;
+};
+thread_local Formatted t_formatted;
 
 struct Conv {
     int index;      // 1-based insert number
@@ -28,69 +99,6 @@ struct Conv {
     size_t begin;   // position of '%'
     size_t end;     // one past the conversion character
 };
-
-}  // namespace
-
-// One error.  The current error of a thread is formatted lazily: recording
-// keeps the inserts and a pointer to the default text (a catalogue's static
-// text), and the message is put together only when someone asks for it, so
-// that reporting stays cheap for callers that report on hot paths.
-struct cu_error {
-    int status = 0;
-    int reserved = 0;
-    std::string catalog;
-    int set = 0;
-    int msgno = 0;
-    const char *deftext_ptr = "";
-    std::string deftext_copy;  // used by handles, which outlive the caller's text
-    bool owns_deftext = false;
-    std::vector<Conv> convs;
-    std::vector<std::string> inserts;
-    std::vector<unsigned long long> raw;
-    mutable std::string text;
-    mutable bool text_valid = false;
-
-    const char *deftext() const { return owns_deftext ? deftext_copy.c_str() : deftext_ptr; }
-    const std::string &formatted() const;
-    cu_error() = default;
-    cu_error(const cu_error &o) { *this = o; }
-    cu_error &operator=(const cu_error &o) {
-        if (this == &o) return *this;
-        status = o.status;
-        reserved = o.reserved;
-        catalog = o.catalog;
-        set = o.set;
-        msgno = o.msgno;
-        deftext_copy = o.deftext();
-        deftext_ptr = "";
-        owns_deftext = true;
-        convs = o.convs;
-        inserts = o.inserts;
-        raw = o.raw;
-        text_valid = false;
-        return *this;
-    }
-};
-
-namespace {
-
-thread_local bool t_pending = false;
-thread_local cu_error t_error;
-thread_local unsigned long t_count = 0;
-// Parsed conversions per default text (texts are static catalogue entries).
-thread_local std::unordered_map<const char *, std::vector<Conv>> t_conv_cache;
-
-// Handles handed out by cu_get_error_1 stay reachable from here until
-// released: a caller that keeps one for the life of the process (trace
-// registration does) does not leak it.
-std::mutex g_handle_mutex;
-std::set<cu_error *> *g_handles = new std::set<cu_error *>;  // never destroyed
-
-std::mutex g_mutex;
-bool g_cluster_override = false;
-std::string g_cluster_name;
-std::atomic<int> g_cluster_fail{0};
-std::atomic<int64_t> g_clock{0};
 
 // Finds the positional conversions "%N$s", "%N$d", "%N$x" (plain "%s"/"%d"
 // count in order of appearance).  "%%" is a literal percent sign.
@@ -117,92 +125,189 @@ std::vector<Conv> conversions(const char *text) {
     return out;
 }
 
+// Fills `slot` with the insert types of `deftext`.
+__attribute__((noinline)) void parse_types(TypeSlot &slot, const char *deftext) {
+    slot.deftext = deftext;
+    slot.count = 0;
+    std::memset(slot.types, 'd', sizeof slot.types);
+    for (const Conv &c : conversions(deftext)) {
+        if (c.index > kMaxInserts) continue;
+        slot.types[c.index - 1] = c.type;
+        slot.count = std::max(slot.count, c.index);
+    }
+}
+
+// The insert types of `deftext`, parsed once per text and thread.
+inline const TypeSlot &types_of(ThreadErrors &te, const char *deftext) {
+    TypeSlot &slot = te.slots[(reinterpret_cast<uintptr_t>(deftext) >> 3) % kTypeSlots];
+    if (slot.deftext != deftext) parse_types(slot, deftext);
+    return slot;
+}
+
+const char *texts_of(const Record &r) { return r.spilled ? t_spill.data() : r.texts; }
+
+// Moves the record's texts to the spill string and appends `s` there.
+__attribute__((noinline)) void spill_text(Record &r, const char *s, size_t n) {
+    if (!r.spilled) t_spill.assign(r.texts, r.used);
+    r.spilled = true;
+    t_spill.append(s, n);
+}
+
+// Appends `s` with its NUL to the record's texts; returns where it starts.
+// Inserts are short: copying eight bytes at a time while looking for the NUL
+// beats a length scan and a copy call.  A word is read only where it cannot
+// cross into the next page, so reading past the NUL touches nothing the
+// text's own page does not hold (hence no sanitizer checks here: they would
+// take the bytes past the NUL for a read of someone else's memory).
+using UnalignedWord = uint64_t __attribute__((may_alias, aligned(1)));
+__attribute__((no_sanitize("address", "thread"))) inline uint32_t keep_text(Record &r, const char *s) {
+    const uint32_t at = r.used;
+    if (!r.spilled) {
+        char *d = r.texts + at;
+        const char *const end = r.texts + sizeof r.texts;
+        const char *c = s;
+        while (end - d >= 8 && (reinterpret_cast<uintptr_t>(c) & 4095) <= 4096 - 8) {
+            const uint64_t w = *reinterpret_cast<const UnalignedWord *>(c);
+            *reinterpret_cast<UnalignedWord *>(d) = w;
+            const uint64_t nul = (w - 0x0101010101010101ull) & ~w & 0x8080808080808080ull;
+            if (nul != 0) {  // the lowest flagged byte is the first NUL
+                r.used = static_cast<uint32_t>(d - r.texts) + (__builtin_ctzll(nul) >> 3) + 1;
+                return at;
+            }
+            c += 8;
+            d += 8;
+        }
+        for (; d != end; ++c)
+            if ((*d++ = *c) == '\0') {
+                r.used = static_cast<uint32_t>(d - r.texts);
+                return at;
+            }
+    }
+    const size_t n = std::strlen(s) + 1;
+    spill_text(r, s, n);
+    r.used = at + static_cast<uint32_t>(n);
+    return at;
+}
+
+// Starts a record for a new current error.
+Record &begin_record(ThreadErrors &te, int status, int reserved, const char *catalog, int set, int msgno,
+                     const char *deftext) {
+    Record &r = te.current;
+    r.status = status;
+    r.reserved = reserved;
+    r.set = set;
+    r.msgno = msgno;
+    r.deftext = deftext;
+    r.catalog = catalog ? catalog : "";
+    r.count = 0;
+    r.used = 0;
+    r.spilled = false;
+    te.pending = true;
+    ++te.serial;
+    return r;
+}
+
 }  // namespace
 
-const std::string &cu_error::formatted() const {
-    if (text_valid) return text;
-    std::string def = deftext();
+// A handle: a copy of an error that owns its default text and its texts.
+struct cu_error {
+    Record rec;
+    std::string catalog;
+    std::string deftext;
+    std::string texts;
+};
+
+namespace {
+
+std::string insert_text(const Record &r, const char *texts, int i) {
+    char buf[32];
+    switch (r.types[i]) {
+    case 's': return texts + r.text_at[i];
+    case 'x': std::snprintf(buf, sizeof buf, "%x", static_cast<unsigned>(r.raw[i])); break;
+    case 'u': std::snprintf(buf, sizeof buf, "%u", static_cast<unsigned>(r.raw[i])); break;
+    default: std::snprintf(buf, sizeof buf, "%d", static_cast<int>(r.raw[i])); break;
+    }
+    return buf;
+}
+
+// The current error's message and inserts, formatted on first read.
+const Formatted &formatted() {
+    Formatted &f = t_formatted;
+    const ThreadErrors &te = t_errors;
+    if (f.serial == te.serial) return f;
+    const Record &r = te.current;
+    const char *texts = texts_of(r);
+    f.inserts.clear();
+    for (int i = 0; i < r.count; ++i) f.inserts.push_back(insert_text(r, texts, i));
+    std::string def = r.deftext;
     std::string out;
     size_t pos = 0;
-    for (const Conv &c : convs) {
+    for (const Conv &c : conversions(r.deftext)) {
         out.append(def, pos, c.begin - pos);
-        if (c.index >= 1 && c.index <= static_cast<int>(inserts.size())) out += inserts[c.index - 1];
+        if (c.index >= 1 && c.index <= r.count) out += f.inserts[c.index - 1];
         pos = c.end;
     }
     out.append(def, pos, std::string::npos);
     // "%%" stands for one percent sign.
     for (size_t i = 0; (i = out.find("%%", i)) != std::string::npos; ++i) out.erase(i, 1);
-    text = std::move(out);
-    text_valid = true;
-    return text;
+    f.text = std::move(out);
+    f.serial = te.serial;
+    return f;
 }
+
+// Handles handed out by cu_get_error_1 stay reachable from here until
+// released: a caller that keeps one for the life of the process (trace
+// registration does) does not leak it.
+std::mutex g_handle_mutex;
+std::set<cu_error *> *g_handles = new std::set<cu_error *>;  // never destroyed
+
+std::mutex g_mutex;
+bool g_cluster_override = false;
+std::string g_cluster_name;
+std::atomic<int> g_cluster_fail{0};
+std::atomic<int64_t> g_clock{0};
+
+}  // namespace
 
 extern "C" int cu_set_error_1(int status, int reserved, const char *catalog, int set, int msgno,
                               const char *deftext, ...) {
-    cu_error &e = t_error;
-    e.status = status;
-    e.reserved = reserved;
-    e.catalog = catalog ? catalog : "";
-    e.set = set;
-    e.msgno = msgno;
-    e.deftext_ptr = deftext ? deftext : "";
-    e.owns_deftext = false;
-    e.text_valid = false;
-    auto it = t_conv_cache.find(e.deftext_ptr);
-    if (it == t_conv_cache.end()) it = t_conv_cache.emplace(e.deftext_ptr, conversions(e.deftext_ptr)).first;
-    e.convs = it->second;
-    int n = 0;
-    for (const Conv &c : e.convs) n = std::max(n, c.index);
-    char types[16] = {};
-    for (const Conv &c : e.convs)
-        if (c.index < 16) types[c.index] = c.type;
-    e.inserts.resize(n);
-    e.raw.assign(n, 0);
+    if (deftext == nullptr) deftext = "";
+    ThreadErrors &te = errors();
+    const TypeSlot &slot = types_of(te, deftext);
+    Record &r = begin_record(te, status, reserved, catalog, set, msgno, deftext);
+    r.count = slot.count;
+    std::memcpy(r.types, slot.types, sizeof r.types);
     va_list ap;
     va_start(ap, deftext);
-    for (int i = 1; i <= n; ++i) {
-        char buf[32];
-        switch (i < 16 ? types[i] : 'd') {
-        case 's': {
+    for (int i = 0; i < slot.count; ++i) {
+        const char type = slot.types[i];
+        if (type == 's') {  // the common insert first
             const char *s = va_arg(ap, const char *);
-            e.inserts[i - 1].assign(s ? s : "(null)");
-            break;
-        }
-        case 'x': {
-            // Pointer-sized on purpose: callers pass the offending value itself.
-            unsigned long long v = va_arg(ap, unsigned long long);
-            e.raw[i - 1] = v;
-            std::snprintf(buf, sizeof buf, "%x", static_cast<unsigned>(v));
-            e.inserts[i - 1].assign(buf);
-            break;
-        }
-        case 'u': {
-            unsigned v = va_arg(ap, unsigned);
-            e.raw[i - 1] = v;
-            std::snprintf(buf, sizeof buf, "%u", v);
-            e.inserts[i - 1].assign(buf);
-            break;
-        }
-        default: {
-            int v = va_arg(ap, int);
-            e.raw[i - 1] = static_cast<unsigned long long>(static_cast<long long>(v));
-            std::snprintf(buf, sizeof buf, "%d", v);
-            e.inserts[i - 1].assign(buf);
-            break;
-        }
+            r.text_at[i] = keep_text(r, s ? s : "(null)");
+            r.raw[i] = 0;
+        } else if (type == 'x') {  // pointer-sized on purpose: callers pass the offending value itself
+            r.raw[i] = va_arg(ap, unsigned long long);
+        } else if (type == 'u') {
+            r.raw[i] = va_arg(ap, unsigned);
+        } else {
+            r.raw[i] = static_cast<unsigned long long>(static_cast<long long>(va_arg(ap, int)));
         }
     }
     va_end(ap);
-    t_pending = true;
-    ++t_count;
+    ++te.count;
     return status;
 }
 
 extern "C" int cu_get_error_1(cu_error_t **handle) {
     if (!handle) return 4;
-    if (!t_pending) return 0;
-    cu_error *copy = new (std::nothrow) cu_error(t_error);
+    const ThreadErrors &te = t_errors;
+    if (!te.pending) return 0;
+    cu_error *copy = new (std::nothrow) cu_error;
     if (!copy) return 6;
+    copy->rec = te.current;
+    copy->catalog = te.current.catalog;
+    copy->deftext = te.current.deftext;
+    copy->texts.assign(texts_of(te.current), te.current.used);
     std::lock_guard<std::mutex> lock(g_handle_mutex);
     g_handles->insert(copy);
     *handle = copy;
@@ -211,8 +316,16 @@ extern "C" int cu_get_error_1(cu_error_t **handle) {
 
 extern "C" int cu_pset_error_1(const cu_error_t *handle) {
     if (!handle) return 4;
-    t_error = *handle;
-    t_pending = true;
+    const Record &from = handle->rec;
+    t_owned_catalog = handle->catalog;
+    t_owned_deftext = handle->deftext;
+    Record &r = begin_record(t_errors, from.status, from.reserved, t_owned_catalog.c_str(), from.set, from.msgno,
+                             t_owned_deftext.c_str());
+    r.count = from.count;
+    std::memcpy(r.types, from.types, sizeof r.types);
+    std::memcpy(r.raw, from.raw, sizeof r.raw);
+    for (int i = 0; i < from.count; ++i)
+        if (from.types[i] == 's') r.text_at[i] = keep_text(r, handle->texts.c_str() + from.text_at[i]);
     return 0;
 }
 
@@ -233,7 +346,22 @@ extern "C" int cu_gettimeofday_1(struct timeval *tv, void *tz) {
         tv->tv_usec = 0;
         return 0;
     }
-    return gettimeofday(tv, static_cast<struct timezone *>(tz)) == 0 ? 0 : errno;
+    if (tz != nullptr) return gettimeofday(tv, static_cast<struct timezone *>(tz)) == 0 ? 0 : errno;
+    // The coarse clock, read without the time-stamp counter, which is slow
+    // in a virtual machine (the library reads the clock once per map file
+    // line).  It lags the precise clock by less than one tick, so its second
+    // is the precise one's unless it is within a tick of the next second;
+    // there the precise clock is read.
+    static const long tick_ns = [] {
+        struct timespec res;
+        return clock_getres(CLOCK_REALTIME_COARSE, &res) == 0 && res.tv_sec == 0 ? res.tv_nsec : 1'000'000'000L;
+    }();
+    struct timespec ts;
+    if (clock_gettime(CLOCK_REALTIME_COARSE, &ts) != 0 || ts.tv_nsec >= 1'000'000'000L - tick_ns)
+        return gettimeofday(tv, nullptr) == 0 ? 0 : errno;
+    tv->tv_sec = ts.tv_sec;
+    tv->tv_usec = static_cast<suseconds_t>(ts.tv_nsec / 1000);
+    return 0;
 }
 
 extern "C" int cu_8bit_strncasecmp_posix_1(const char *s1, const char *s2, size_t n) {
@@ -289,24 +417,38 @@ extern "C" int cu_get_cluster_info_1(cu_cluster_info_t *info) {
 }
 
 // ---- inspection ----
-extern "C" int cux_error_pending(void) { return t_pending ? 1 : 0; }
-extern "C" void cux_clear_error(void) { t_pending = false; t_error = cu_error(); }
-extern "C" unsigned long cux_error_count(void) { return t_count; }
-extern "C" int cux_error_status(void) { return t_pending ? t_error.status : 0; }
-extern "C" int cux_error_reserved(void) { return t_error.reserved; }
-extern "C" const char *cux_error_catalog(void) { return t_error.catalog.c_str(); }
-extern "C" int cux_error_set(void) { return t_error.set; }
-extern "C" int cux_error_msgno(void) { return t_pending ? t_error.msgno : 0; }
-extern "C" const char *cux_error_deftext(void) { return t_error.deftext(); }
-extern "C" const char *cux_error_text(void) { return t_error.formatted().c_str(); }
-extern "C" int cux_error_insert_count(void) { return static_cast<int>(t_error.inserts.size()); }
+extern "C" int cux_error_pending(void) { return t_errors.pending ? 1 : 0; }
+extern "C" void cux_clear_error(void) {
+    ThreadErrors &te = t_errors;
+    te.pending = false;
+    te.current = Record{};
+    te.current.deftext = "";
+    ++te.serial;
+}
+extern "C" unsigned long cux_error_count(void) { return t_errors.count; }
+extern "C" int cux_error_status(void) { return t_errors.pending ? t_errors.current.status : 0; }
+extern "C" int cux_error_reserved(void) { return t_errors.current.reserved; }
+extern "C" const char *cux_error_catalog(void) {
+    const char *c = t_errors.current.catalog;
+    return c ? c : "";
+}
+extern "C" int cux_error_set(void) { return t_errors.current.set; }
+extern "C" int cux_error_msgno(void) { return t_errors.pending ? t_errors.current.msgno : 0; }
+extern "C" const char *cux_error_deftext(void) {
+    const char *d = t_errors.current.deftext;
+    return d ? d : "";
+}
+extern "C" const char *cux_error_text(void) { return formatted().text.c_str(); }
+extern "C" int cux_error_insert_count(void) { return t_errors.current.count; }
 extern "C" const char *cux_error_insert(int i) {
-    if (i < 1 || i > static_cast<int>(t_error.inserts.size())) return nullptr;
-    return t_error.inserts[i - 1].c_str();
+    const Formatted &f = formatted();
+    if (i < 1 || i > static_cast<int>(f.inserts.size())) return nullptr;
+    return f.inserts[i - 1].c_str();
 }
 extern "C" unsigned long long cux_error_insert_raw(int i) {
-    if (i < 1 || i > static_cast<int>(t_error.raw.size())) return 0;
-    return t_error.raw[i - 1];
+    const Record &r = t_errors.current;
+    if (i < 1 || i > r.count) return 0;
+    return r.raw[i - 1];
 }
 extern "C" unsigned long cux_handles_live(void) {
     std::lock_guard<std::mutex> lock(g_handle_mutex);

@@ -3,9 +3,11 @@
  * inspection calls of this stand-in implementation.
  *
  * Error facility: each thread has one current error.  cu_set_error_1 makes a
- * new one current, formatting the message from its default text and the
- * inserts (positional conversions %N$s, %N$d, %N$x are understood; the insert
- * types are taken from the text).
+ * new one current: it keeps the numbers, the default text's address and the
+ * inserts (positional conversions %N$s, %N$d, %N$x, %N$u are understood; the
+ * insert types are taken from the text, at most 16 inserts), copying text
+ * inserts into the thread's record without formatting and without a heap
+ * allocation while they fit.  The message is formatted when it is read.
  *
  * Active cluster: cu_get_cluster_info_1 reads the active cluster's name from
  * the first line of CU_ACTIVE_CLUSTER_FILE, unless a program set a name with

@@ -11,7 +11,8 @@ namespace {
 
 using oxtest::kNodeInfo;
 
-const char kFile[] = "NODE:\nNAME: hosta\nADDRESS: 10.1.1.1\nCLUSTER: clA clB\nNODE:\nNAME: hostc\nCLUSTER: ClA\n";
+const char kFile[] = "NODE:\nNAME: hosta\nADDRESS: 10.1.1.1\nCLUSTER: clA clB\nNODE:\nNAME: hostc\nCLUSTER: ClA\n"
+                     "NODE:\nNAME: beef 1host\nADDRESS: ::1 fd00::1 FD00::2\nCLUSTER: clD\n";
 
 class ClusterQueries : public oxtest::Test {
   protected:
@@ -35,6 +36,9 @@ TEST_F(ClusterQueries, Answers) {
         {"cluster names with case", "hostc", "clA", 1, 0},
         {"a prefix of the active name", "hosta", "clAx", 1, 0},
         {"not listed", "hostb", "clA", -1, -1},
+        {"address from a colon", "::1", "clD", 1, 1},      {"from a hex letter", "fd00::1", "clD", 1, 1},
+        {"from an upper-case one", "FD00::2", "clD", 1, 1}, {"name of hex letters", "beef", "clD", 1, 1},
+        {"name from a digit", "1host", "clD", 1, 1},
         {"null host", nullptr, "clA", -1, -1},
     };
     for (const auto &row : rows) {

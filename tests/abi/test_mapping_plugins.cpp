@@ -26,6 +26,8 @@ void expect_answers(std::initializer_list<Answer> answers) {
 
 TEST(MappingPlugins, HostAndPrincipalIdentities) {
     OXTEST_REQUIRE_NAMESPACE();
+    // Ids past the plug-ins' small per-thread block are translated on the heap.
+    const std::string long_user(250, 'u'), long_host = long_user + "@node1", long_princ = long_user + "@EXAMPLE.ORG";
     ASSERT_EQ(oxmpm_host_register() + oxmpm_principal_register(), 0);
     oxtest::write_file(oxtest::kLocalMap,
                        "host:!mallory@*\nhost:alice@node1=alice\nhost:not-an-identity=x\nhost:*@node1=*\n"
@@ -40,12 +42,18 @@ TEST(MappingPlugins, HostAndPrincipalIdentities) {
         {"host", "Bob@node1", 0, "Bob"},      {"host", "mallory@node1", 0, ""},  // the denial comes first
         {"host", "carol@web.example.org", 0, "guest"}, {"host", "root@db", 0, "admin"},
         {"host", "dave@elsewhere", 0, "nobody"},       {"host", "a@b@c", IDM_E_RULE, ""},
+        {"host", "@node1", IDM_E_RULE, ""},            {"host", "alice@", IDM_E_RULE, ""},
+        {"host", "*", 0, "nobody"},                    {"host", long_host.c_str(), 0, long_user.c_str()},
         {"princ", "joe@EXAMPLE.ORG", 0, "joe"},        {"princ", "amy/root@EXAMPLE.ORG", 0, ""},
         {"princ", "amy/admin@EXAMPLE.ORG", 0, "root"}, {"princ", "joe/web@EXAMPLE.ORG", 0, "web"},
         {"princ", "ann@EXAMPLE.ORG", 0, "ann"},        {"princ", "ann@DEV.EXAMPLE.ORG", 0, "guest"},
         {"princ", "ann@example.org", 0, ""},           // realms are case-sensitive
         {"princ", "amy/web@EXAMPLE.ORG", 0, ""},       // two tokens could name the user: unusable
-        {"princ", "no-realm", IDM_E_RULE, ""},
+        {"princ", "no-realm", IDM_E_RULE, ""},         {"princ", "/root@EXAMPLE.ORG", IDM_E_RULE, ""},
+        {"princ", "joe/@EXAMPLE.ORG", IDM_E_RULE, ""}, {"princ", "a/b/c@EXAMPLE.ORG", IDM_E_RULE, ""},
+        {"princ", "joe@", IDM_E_RULE, ""},             {"princ", "joe@A@EXAMPLE.ORG", IDM_E_RULE, ""},
+        {"princ", "ann@X/Y.EXAMPLE.ORG", 0, "guest"},  // a realm may hold a '/'
+        {"princ", long_princ.c_str(), 0, long_user.c_str()},
     });
 }
 

@@ -117,6 +117,7 @@ TEST(NatmapRules, CheckAndApplyAgreeWithReference) {
 // A failed application is one report, of the first check that fails; the
 // result is left alone.
 TEST(NatmapRules, FailedApplicationReportsTheFirstFailingCheck) {
+    const std::string long_a(300, 'a'), long_b(300, 'b');  // together past the error record's inline texts
     struct Case { Rule rule; Id id; int msgno; Strs inserts; } cases[] = {
         {{"m", "r", {"**"}}, {nullptr, "r", {}}, idm::kMsg662, {}},  // the rule first
         {{"m", "r", {"a"}}, {nullptr, "r", {"a"}}, idm::kMsg665, {}},
@@ -129,6 +130,7 @@ TEST(NatmapRules, FailedApplicationReportsTheFirstFailingCheck) {
         {{"mech", "r", {"a"}}, {"mechs", "r", {"a"}}, idm::kMsg663, {}},
         {{"m", "r*m", {"x"}}, {"m", "rmx", {"a"}}, idm::kMsg667, {"r*m", "rmx"}},       // registry before tokens
         {{"m", "r", {"a", "b*", "c"}}, {"m", "r", {"a", "x", "y"}}, idm::kMsg666, {"b*", "x"}},
+        {{"m", "r", {long_a.c_str()}}, {"m", "r", {long_b.c_str()}}, idm::kMsg666, {long_a, long_b}},
         {{"m", "r", {"a", "b"}}, {"m", "r", {"a", ""}}, idm::kMsg650, {}},  // the empty token, 2nd
     };
     for (Case &c : cases) {

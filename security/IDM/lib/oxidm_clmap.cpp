@@ -546,6 +546,10 @@ void empty_trees(MapHold &hold) OXIDM_REQUIRES_SHARED(idmutex) {
 }
 
 bool is_address(const char *host) {
+    // Every address text inet_pton takes begins with a hexadecimal digit or
+    // ':'; a name that begins with anything else is told without it.
+    const unsigned char c = static_cast<unsigned char>(host[0]);
+    if (c != ':' && !std::isxdigit(c)) return false;
     unsigned char address[sizeof(struct in6_addr)];
     return inet_pton(AF_INET, host, address) == 1 || inet_pton(AF_INET6, host, address) != 0;
 }

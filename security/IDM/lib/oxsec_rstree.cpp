@@ -19,6 +19,14 @@ namespace {
 
 bool usable(const rst_tree *tree) { return tree != nullptr && tree->rst_magic == kRstMagic; }
 
+// Asks for the cache lines a search reaching `n` will read next: its object
+// and its children.
+inline void fetch_ahead(const rst_node *n) {
+    __builtin_prefetch(n->object);
+    __builtin_prefetch(n->left);
+    __builtin_prefetch(n->right);
+}
+
 // The left child takes n's place; n becomes its right child.
 void rotate_right(rst_node **link) {
     rst_node *n = *link;
@@ -50,6 +58,8 @@ int rst_insert_recurse(rst_tree *tree, rst_node **link, void **object) {
         tree->rst_node_cnt++;
         return 1;
     }
+    if (n->left != nullptr) fetch_ahead(n->left);  // as in sec__rst_find
+    if (n->right != nullptr) fetch_ahead(n->right);
     int r = tree->rst_compare(*object, n->object);
     if (r == 0) {
         *object = n->object;
@@ -114,7 +124,13 @@ int sec__rst_insert(rst_tree *tree, void **object) {
 int sec__rst_find(rst_tree *tree, void **probe) {
     if (!usable(tree) || probe == nullptr || *probe == nullptr) return -1;
     const rst_node *n = tree->rst_root;
+    if (n != nullptr) fetch_ahead(n);
     while (n != nullptr) {
+        // The next level's objects and the level after's nodes are fetched
+        // while this level compares: a search of a tree larger than the
+        // caches waits for about one miss per level instead of two.
+        if (n->left != nullptr) fetch_ahead(n->left);
+        if (n->right != nullptr) fetch_ahead(n->right);
         int r = tree->rst_compare(*probe, n->object);
         if (r == 0) {
             *probe = n->object;
