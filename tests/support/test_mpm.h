@@ -43,6 +43,18 @@ inline idm_buffer *mapping_of(const char *local) {
     return new (std::malloc(sizeof(idm_buffer))) idm_buffer{static_cast<uint32_t>(std::strlen(local) + 1), heap_copy(local)};
 }
 
+// What the test translators hand over: a rule (when there is an entry) of
+// registry type "t", registry "r" and the one token `token` (the entry's
+// network identifier when null), mapping to the entry's local identifier;
+// and an id of the same registry with the network identifier as its token.
+inline void fill_rule_and_id(const idm_mapfile_entry *entry, const char *network_id, idm_rule *rule, idm_id *id,
+                             const char *token = nullptr) {
+    if (entry != nullptr)
+        *rule = {0, heap_copy("t"), heap_copy("r"), 1, one_token(token ? token : entry->network_id),
+                 entry->local_id ? mapping_of(entry->local_id) : nullptr};
+    *id = {heap_copy("t"), heap_copy("r"), 1, one_token(network_id)};
+}
+
 // Frees what a test translator put in a rule and an id (one token at most)
 // and clears both records.
 inline int32_t free_rule_and_id(idm_rule *rule, idm_id *id) {

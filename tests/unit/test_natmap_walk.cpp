@@ -24,14 +24,9 @@ const char *token_of(const idm_rule *r) { return r->tokens != nullptr ? r->token
 template <char Tag>
 int32_t translate(const idm_mapfile_entry *entry, const char *network_id, idm_rule *rule, idm_id *id) {
     g_log += std::string(Tag == 'A' ? "" : "B") + "T " + (entry ? entry->network_id : std::string("-:") + token_of(rule)) + ";";
-    int32_t status = network_id[0] == '#' ? std::atoi(network_id + 1) : 0;
-    if (entry != nullptr) {
-        const char *dot = std::strchr(entry->network_id, '.');
-        if (dot != nullptr) status = std::atoi(entry->network_id);
-        *rule = {0, heap_copy("test"), heap_copy("r"), 1, one_token(dot ? dot + 1 : entry->network_id),
-                 entry->local_id ? mapping_of(entry->local_id) : nullptr};
-    }
-    *id = {heap_copy("test"), heap_copy("r"), 1, one_token(network_id)};
+    const char *dot = entry ? std::strchr(entry->network_id, '.') : nullptr;
+    const int32_t status = dot ? std::atoi(entry->network_id) : network_id[0] == '#' ? std::atoi(network_id + 1) : 0;
+    fill_rule_and_id(entry, network_id, rule, id, dot ? dot + 1 : nullptr);
     if (status != 0 && status != IDM_TRANSLATOR_STOP && status != IDM_TRANSLATOR_REJECT && status != IDM_TRANSLATOR_REFUSED)
         free_rule_and_id(entry ? rule : nullptr, id);
     return status;

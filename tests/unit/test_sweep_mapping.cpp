@@ -26,18 +26,7 @@ using sweep::st;
 // seen even when later entries report their own mismatches.
 int32_t translate(const idm_mapfile_entry *entry, const char *network_id, idm_rule *rule, idm_id *id) {
     sweep::note();
-    if (entry != nullptr) {
-        *rule = idm_rule{};
-        rule->rgy_type = heap_copy("sw");
-        rule->rgy = heap_copy("R");
-        rule->token_cnt = 1;
-        rule->tokens = oxtest::one_token(entry->network_id);
-        if (entry->local_id != nullptr) rule->mapping = oxtest::mapping_of(entry->local_id);
-    }
-    id->rgy_type = heap_copy("sw");
-    id->rgy = heap_copy("R");
-    id->token_cnt = 1;
-    id->tokens = oxtest::one_token(network_id);
+    oxtest::fill_rule_and_id(entry, network_id, rule, id);
     return 0;
 }
 int32_t cleanup(idm_rule *rule, idm_id *id) {

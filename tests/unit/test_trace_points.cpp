@@ -45,11 +45,7 @@ namespace tp = idm::trace::tp;
 // identifier the mapping; an identity "stop" ends the walk.
 int32_t translate(const idm_mapfile_entry *entry, const char *network_id, idm_rule *rule, idm_id *id) {
     if (std::string_view(network_id) == "stop") return IDM_TRANSLATOR_STOP;
-    if (entry != nullptr) {
-        *rule = idm_rule{0, oxtest::heap_copy("t"), oxtest::heap_copy("r"), 1, oxtest::one_token(entry->network_id),
-                         entry->local_id != nullptr ? oxtest::mapping_of(entry->local_id) : nullptr};
-    }
-    *id = idm_id{oxtest::heap_copy("t"), oxtest::heap_copy("r"), 1, oxtest::one_token(network_id)};
+    oxtest::fill_rule_and_id(entry, network_id, rule, id);
     return IDM_OK;
 }
 int32_t cleanup(idm_rule *rule, idm_id *id) { return oxtest::free_rule_and_id(rule, id); }
