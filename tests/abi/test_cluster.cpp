@@ -1,6 +1,5 @@
 // The exported cluster queries through the shipped library: 1, 0 and -1
-// for listed, unlisted and unknown hosts and active clusters; what stays
-// reported after a failed load.
+// for listed, unlisted and unknown hosts and active clusters.
 #include <string>
 
 #include "harness.h"
@@ -51,17 +50,6 @@ TEST_F(ClusterQueries, Answers) {
         EXPECT_EQ(sec_is_in_active_cluster(row.host), row.in_active);
         EXPECT_TRUE(oxtest::nothing_but_list_ends());
     }
-}
-
-TEST_F(ClusterQueries, AFailedLoadIsReportedOnlyByTheQueryThatRanIt) {
-    cux_set_active_cluster("clA");
-    oxtest::write_file(kNodeInfo, std::string(kFile) + "CLUSTER: stray\n", 1000);
-    EXPECT_EQ(sec_is_in_active_cluster("hosta"), -1);
-    EXPECT_TRUE(oxtest::reported(IDM_E_NODE_FILE, idm::kMsg690, {}));
-    oxtest::clear_errors();
-    EXPECT_EQ(sec_is_in_active_cluster("hosta"), -1);
-    EXPECT_EQ(sec_is_in_any_cluster("hosta"), -1);
-    EXPECT_TRUE(oxtest::nothing_reported());
 }
 
 }  // namespace

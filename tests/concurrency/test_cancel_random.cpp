@@ -83,7 +83,7 @@ TEST_F(CancelRandom, ThreadsCancelledAnywhereLeaveNothingBehind) {
     stop = true;
     for (std::thread *t : {&rewriter, &writer, &bystander}) t->join();
     EXPECT_EQ(wrong.load(), 0);
-    EXPECT_TRUE(threads::unlocked(&idm__native_find_translator("s0")->mutex) && threads::unlocked(&idm__native_state.mutex));
+    EXPECT_TRUE(oxtest::unlocked(&idm__native_find_translator("s0")->mutex) && oxtest::unlocked(&idm__native_state.mutex));
     EXPECT_EQ(mssx_locks_held(), 0);
     EXPECT_EQ(threads::counts(idmutex), (threads::Counts{0, 0}));
     EXPECT_EQ(open_descriptors(), descriptors);

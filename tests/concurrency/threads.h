@@ -67,8 +67,6 @@ inline Counts counts(sec_rwlock &lock) {
     return c;
 }
 
-inline bool unlocked(pthread_mutex_t *m) { return pthread_mutex_trylock(m) == 0 && pthread_mutex_unlock(m) == 0; }
-
 // The fixture of the tests with files: the private namespace, and /proc
 // showing what a thread sleeps on.
 class Test : public oxtest::Test {

@@ -5,6 +5,7 @@
 #define OXIDM_TEST_HARNESS_H
 
 #include <gtest/gtest.h>
+#include <pthread.h>
 #include <sys/types.h>
 
 #include <cstdint>
@@ -72,6 +73,9 @@ class Test : public ::testing::Test {
 };
 
 // Runs `body` in a child process; returns its exit status (or 128+signal).
+// True when `m` is free (taken and given back at once).
+inline bool unlocked(pthread_mutex_t *m) { return pthread_mutex_trylock(m) == 0 && pthread_mutex_unlock(m) == 0; }
+
 int run_in_child(void (*body)(void *), void *arg);
 
 }  // namespace oxtest

@@ -45,12 +45,6 @@ inline void check_zeroed(const void *p, size_t n) {
     if (std::any_of(b, b + n, [](unsigned char c) { return c != 0; })) g_unzeroed.fetch_add(1);
 }
 
-inline bool unlocked(pthread_mutex_t *m) {
-    if (pthread_mutex_trylock(m) != 0) return false;
-    pthread_mutex_unlock(m);
-    return true;
-}
-
 // Reports made during a step.  A later report replaces the current error,
 // so an operation that goes on after a failure (a mapping walk) calls note()
 // from its callbacks as well.

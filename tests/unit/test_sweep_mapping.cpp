@@ -93,9 +93,9 @@ TEST_F(SweepMapping, PassOverTwoFilesWithRulesCached) {
         [&] {
             EXPECT_EQ(mssx_locks_held(), 0);
             EXPECT_EQ(oxtest::open_descriptors(), descriptors);
-            EXPECT_TRUE(sweep::unlocked(&idm__native_state.mutex));
+            EXPECT_TRUE(oxtest::unlocked(&idm__native_state.mutex));
             idm_translator *record = idm__native_find_translator(mech.c_str());
-            EXPECT_TRUE(record != nullptr && sweep::unlocked(&record->mutex));
+            EXPECT_TRUE(record != nullptr && oxtest::unlocked(&record->mutex));
         },
         [&] {  // a change of a file brings every entry back
             oxtest::set_mtime(oxtest::kLocalMap, mtime += 10);
@@ -112,31 +112,22 @@ TEST_F(SweepMapping, Registration) {
     ASSERT_EQ(sec_idm_register_translator(1, "first", translate, cleanup), 0);  // once-controls outside the count
     std::string mnemonic;
     uint32_t count = 0;
-    std::vector<Row> rows = {
-        {"translator record, mnemonic copy", idm::kMsg654, "idm__native_register_translator", idm::kNoMemory,
-         st(idm::kNoMemory, " unlisted +0"), {"0 listed +1"}},
+    std::vector<Row> rows = {{"translator record, mnemonic copy", idm::kMsg654, "idm__native_register_translator",
+                              idm::kNoMemory, st(idm::kNoMemory, " unlisted +0"), {"0 listed +1"}}};
+    auto listed = [&](int32_t status) {
+        idm_translator_routine t = nullptr;
+        idm_cleanup_routine c = nullptr;
+        EXPECT_EQ(_sec_idm_get_translator(mnemonic.c_str(), &t, &c), 0);
+        return std::to_string(status) + (t == translate && c == cleanup ? " listed +" : " unlisted +") +
+               std::to_string(idm__native_state.translator_count - count);
     };
-    sweep::Operation op{
-        [&](long n) {
-            mnemonic = num("regist", n);
-            count = idm__native_state.translator_count;
-        },
-        [&] {
-            const int32_t status = sec_idm_register_translator(1, mnemonic.c_str(), translate, cleanup);
-            idm_translator_routine t = nullptr;
-            idm_cleanup_routine c = nullptr;
-            EXPECT_EQ(_sec_idm_get_translator(mnemonic.c_str(), &t, &c), 0);
-            return std::to_string(status) + (t == translate && c == cleanup ? " listed +" : " unlisted +") +
-                   std::to_string(idm__native_state.translator_count - count);
-        },
-        "0 listed +1",
-        [] { EXPECT_TRUE(sweep::unlocked(&idm__native_state.mutex)); },
-        [&] {  // registering again replaces the routines of the one record; the list still works
-            EXPECT_EQ(sec_idm_register_translator(1, mnemonic.c_str(), translate, cleanup), 0);
-            EXPECT_EQ(idm__native_state.translator_count, count + 1);
-            EXPECT_EQ(map("first", "joe"), "0 ");
-        },
-    };
+    auto reg = [&] { return listed(sec_idm_register_translator(1, mnemonic.c_str(), translate, cleanup)); };
+    sweep::Operation op{[&](long n) { mnemonic = num("regist", n), count = idm__native_state.translator_count; }, reg,
+                        "0 listed +1", [] { EXPECT_TRUE(oxtest::unlocked(&idm__native_state.mutex)); },
+                        [&] {  // registering again replaces the routines of the one record; the list still works
+                            EXPECT_EQ(reg(), "0 listed +1");
+                            EXPECT_EQ(map("first", "joe"), "0 ");
+                        }};
     EXPECT_EQ(sweep::run(op, rows), 2);
 }
 
@@ -185,11 +176,9 @@ TEST_F(Zeroed, IdentifiersPathsResultsAndGroupBuffers) {
     for (int32_t i = 0; i < set->count; ++i) texts.emplace_back(set->names[i], std::strlen(set->names[i]) + 1);
     idm__native_release_cachef(set);
     expect_routed(texts, 4);
-    // A group lookup: the user buffer (twice the suggested size), the primary
-    // group's and the scan buffer, each zeroed whole.
+    // A group lookup: the user's, the primary group's and the scan buffer.
     const passwd *root = getpwuid(0);
-    const long pw = sysconf(_SC_GETPW_R_SIZE_MAX), gr = sysconf(_SC_GETGR_R_SIZE_MAX);
-    if (root == nullptr || pw <= 0 || gr <= 0) GTEST_SKIP() << "no user 0 or no suggested buffer sizes";
+    if (root == nullptr) GTEST_SKIP() << "no user 0";
     const std::string name = root->pw_name;
     idm_buffer user{static_cast<uint32_t>(name.size() + 1), const_cast<char *>(name.c_str())};
     uint32_t count = 0;
@@ -198,9 +187,7 @@ TEST_F(Zeroed, IdentifiersPathsResultsAndGroupBuffers) {
     idm_test_on_secret_free(nullptr);
     for (uint32_t i = 0; i < count; ++i) std::free(groups[i].value);
     std::free(groups);
-    std::multiset<size_t> sizes;
-    for (const auto &block : g_routed) sizes.insert(block.second);
-    EXPECT_EQ(sizes, (std::multiset<size_t>{size_t(2 * pw), size_t(gr), size_t(gr)}));
+    EXPECT_EQ(g_routed.size(), 3u);
     EXPECT_EQ(sweep::g_unzeroed.exchange(0), 0);
 }
 
