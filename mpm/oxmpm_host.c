@@ -98,6 +98,36 @@ struct small_block {
 };
 static _Thread_local struct small_block small;
 
+/* An id is copied eight bytes at a time (x86-64: little-endian, unaligned
+ * loads) in one pass that also finds its separators.  Each part goes to the
+ * small block in whole-word stores, starting at a word boundary and padded
+ * with NULs to the next one, so that the word loads with which libox_idm
+ * compares the parts just afterwards find each of them in one earlier store. */
+typedef uint64_t unaligned_word __attribute__((may_alias, aligned(1)));
+#define ONES 0x0101010101010101ull
+
+/* The high bit of each byte of `w` that is zero; the lowest one is exact. */
+static inline uint64_t zero_bytes(uint64_t w) { return (w - ONES) & ~w & (ONES << 7); }
+
+/* `w` with its ASCII capitals folded to lower case, all eight at once. */
+static inline uint64_t fold_word(uint64_t w) {
+    const uint64_t low7 = w & ~(ONES << 7);
+    const uint64_t from_a = low7 + ONES * (0x80 - 'A'); /* high bit: at least 'A' */
+    const uint64_t past_z = low7 + ONES * (0x7F - 'Z'); /* high bit: past 'Z' */
+    return w | ((from_a & ~past_z & ~w & (ONES << 7)) >> 2);
+}
+
+/* The eight bytes of text at `s`: read as one word where that cannot cross
+ * into the next page (the bytes past a NUL it may hold then lie on the
+ * NUL's own page; the sanitizers would take them for someone else's memory,
+ * hence no checks here), else byte by byte up to the NUL. */
+__attribute__((no_sanitize("address", "thread"))) static inline uint64_t text_word(const char *s) {
+    if (((uintptr_t)s & 4095) <= 4096 - 8) return *(const unaligned_word *)s;
+    uint64_t w = 0;
+    for (int k = 0; k < 8 && s[k] != '\0'; ++k) w |= (uint64_t)(unsigned char)s[k] << (8 * k);
+    return w;
+}
+
 static struct block *new_block(size_t text_size) {
     struct block *b = malloc(sizeof(struct block) + text_size);
     if (b == NULL) return NULL;
@@ -112,17 +142,10 @@ static struct block *new_block(size_t text_size) {
 static void free_block(char **tokens) {
     if (tokens == NULL) return;
     struct block *b = (struct block *)(void *)((char *)tokens - offsetof(struct block, tokens));
-    unsigned char *small = b->small_in_use;
-    if (small == NULL) {
-        explicit_bzero(b, b->size);
-        free(b);
-        return;
-    }
-    /* The small block is zeroed a word at a time in line (it is short and
-     * word-aligned); the volatile stores are kept like explicit_bzero's. */
-    volatile uint64_t *w = (volatile uint64_t *)(void *)b;
-    for (size_t i = 0, n = (b->size + 7) / 8; i < n; ++i) w[i] = 0;
-    __atomic_store_n(small, 0, __ATOMIC_RELEASE);
+    unsigned char *small_in_use = b->small_in_use;
+    explicit_bzero(b, b->size);
+    if (small_in_use == NULL) free(b);
+    else __atomic_store_n(small_in_use, 0, __ATOMIC_RELEASE);
 }
 
 static int32_t fill_rule(const idm_mapfile_entry *entry, idm_rule *rule) {
@@ -150,45 +173,54 @@ static int32_t fill_rule(const idm_mapfile_entry *entry, idm_rule *rule) {
     return ST_OK;
 }
 
-/* The id of a plain user@host in the thread's small block, copied in one
- * pass: the user as written, its NUL, the host folded.  0 when done; -1
- * when the block is taken, the text does not fit or is anything but a plain
- * user@host (fill_id then takes the general path, which also gives the
- * status of a bad one). */
+/* The id of a plain user@host in the thread's small block, copied and cut
+ * in one pass: the user as written, the host folded to lower case.  0 when
+ * done; -1 when the block is taken, the text does not fit or is anything but
+ * a plain user@host (fill_id then takes the general path, which also gives
+ * the status of a bad one). */
 static int fill_id_small(const char *network_id, idm_id *id) {
     struct small_block *sm = &small;
     __asm__("" : "+r"(sm)); /* one thread-local look-up, not one per use */
     if (__atomic_load_n(&sm->in_use, __ATOMIC_ACQUIRE)) return -1;
     struct block *b = (struct block *)(void *)sm->bytes;
-    char *t = b->text;
-    char *const last = b->text + SMALL_TEXT - 1; /* room for the last NUL */
+    char *const text = b->text;
+    char *const end = text + SMALL_TEXT;
+    int host = 0; /* which part: the user (ends at the '@'), then the host (at the NUL) */
     const char *s = network_id;
-    for (;; ++s) {
-        if (*s == '@') break;
-        if (*s == '\0' || t == last) goto fail;
-        *t++ = *s;
+    const char *part_begin = s;
+    char *t = text;
+    for (;;) {
+        if (t == end) goto fail;
+        const uint64_t w = text_word(s);
+        const uint64_t m = zero_bytes(w) | zero_bytes(w ^ (ONES * '@'));
+        if (m == 0) {
+            *(unaligned_word *)t = host ? fold_word(w) : w;
+            s += 8;
+            t += 8;
+            continue;
+        }
+        const unsigned k = (unsigned)__builtin_ctzll(m) >> 3;
+        const uint64_t last = k != 0 ? w & (~0ull >> (64 - 8 * k)) : 0;
+        *(unaligned_word *)t = host ? fold_word(last) : last;
+        t += 8;
+        s += k;
+        const char c = (char)(w >> (8 * k));
+        if (s == part_begin || c != (host ? '\0' : '@')) goto fail; /* an empty part, no '@' or a second one */
+        if (host) break;
+        host = 1;
+        id->rgy = t;
+        part_begin = ++s;
     }
-    if (t == b->text) goto fail;
-    *t++ = '\0';
-    char *host = t;
-    for (++s; *s != '\0'; ++s) {
-        unsigned char c = (unsigned char)*s;
-        if (c == '@' || t == last) goto fail;
-        *t++ = (char)(c + ((unsigned char)(c - 'A') < 26u ? 'a' - 'A' : 0));
-    }
-    if (t == host) goto fail;
-    *t++ = '\0';
     sm->in_use = 1;
     b->size = (size_t)(t - (char *)b);
     b->small_in_use = &sm->in_use;
-    b->tokens[0] = b->text;
-    id->rgy = host;
+    b->tokens[0] = text;
     id->rgy_type = mnemonic;
     id->token_cnt = 1;
     id->tokens = b->tokens;
     return 0;
 fail:
-    explicit_bzero(b->text, (size_t)(t - b->text));
+    explicit_bzero(text, (size_t)(t - text));
     return -1;
 }
 

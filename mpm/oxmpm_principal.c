@@ -82,6 +82,28 @@ struct small_block {
 };
 static _Thread_local struct small_block small;
 
+/* An id is copied eight bytes at a time (x86-64: little-endian, unaligned
+ * loads) in one pass that also finds its separators.  Each part goes to the
+ * small block in whole-word stores, starting at a word boundary and padded
+ * with NULs to the next one, so that the word loads with which libox_idm
+ * compares the parts just afterwards find each of them in one earlier store. */
+typedef uint64_t unaligned_word __attribute__((may_alias, aligned(1)));
+#define ONES 0x0101010101010101ull
+
+/* The high bit of each byte of `w` that is zero; the lowest one is exact. */
+static inline uint64_t zero_bytes(uint64_t w) { return (w - ONES) & ~w & (ONES << 7); }
+
+/* The eight bytes of text at `s`: read as one word where that cannot cross
+ * into the next page (the bytes past a NUL it may hold then lie on the
+ * NUL's own page; the sanitizers would take them for someone else's memory,
+ * hence no checks here), else byte by byte up to the NUL. */
+__attribute__((no_sanitize("address", "thread"))) static inline uint64_t text_word(const char *s) {
+    if (((uintptr_t)s & 4095) <= 4096 - 8) return *(const unaligned_word *)s;
+    uint64_t w = 0;
+    for (int k = 0; k < 8 && s[k] != '\0'; ++k) w |= (uint64_t)(unsigned char)s[k] << (8 * k);
+    return w;
+}
+
 static char *put(char *dst, const char *src, size_t n) {
     memcpy(dst, src, n);
     dst[n] = '\0';
@@ -122,16 +144,9 @@ static void free_block(char **tokens) {
     if (tokens == NULL) return;
     struct block *b = (struct block *)(void *)((char *)tokens - offsetof(struct block, tokens));
     unsigned char *small_in_use = b->small_in_use;
-    if (small_in_use == NULL) {
-        explicit_bzero(b, b->size);
-        free(b);
-        return;
-    }
-    /* The small block is zeroed a word at a time in line (it is short and
-     * word-aligned); the volatile stores are kept like explicit_bzero's. */
-    volatile uint64_t *w = (volatile uint64_t *)(void *)b;
-    for (size_t i = 0, n = (b->size + 7) / 8; i < n; ++i) w[i] = 0;
-    __atomic_store_n(small_in_use, 0, __ATOMIC_RELEASE);
+    explicit_bzero(b, b->size);
+    if (small_in_use == NULL) free(b);
+    else __atomic_store_n(small_in_use, 0, __ATOMIC_RELEASE);
 }
 
 static int32_t fill_rule(const idm_mapfile_entry *entry, idm_rule *rule) {
@@ -154,7 +169,7 @@ static int32_t fill_rule(const idm_mapfile_entry *entry, idm_rule *rule) {
 }
 
 /* The id of a plain name[/instance]@REALM in the thread's small block,
- * copied in one pass with a NUL after each part.  0 when done; -1 when the
+ * copied and cut into its parts in one pass.  0 when done; -1 when the
  * block is taken, the text does not fit or is not a well-formed principal
  * (fill_id then takes the general path, which also gives the status of a
  * bad one). */
@@ -163,46 +178,60 @@ static int fill_id_small(const char *network_id, idm_id *id) {
     __asm__("" : "+r"(sm)); /* one thread-local look-up, not one per use */
     if (__atomic_load_n(&sm->in_use, __ATOMIC_ACQUIRE)) return -1;
     struct block *b = (struct block *)(void *)sm->bytes;
-    char *t = b->text;
-    char *const last = b->text + SMALL_TEXT - 1; /* room for the last NUL */
+    char *const text = b->text;
+    char *const end = text + SMALL_TEXT;
+    enum { NAME, INSTANCE, REALM } part = NAME;
     const char *s = network_id;
-    for (; *s != '@' && *s != '/'; ++s) {
-        if (*s == '\0' || t == last) goto fail;
-        *t++ = *s;
-    }
-    if (t == b->text) goto fail;
-    *t++ = '\0';
+    const char *part_begin = s;
+    char *t = text;
+    /* A part ends at its first NUL, '@' or `other` ('/' for the name and the
+     * instance, which are judged by the separator found; '@' for the realm). */
+    uint64_t other = ONES * '/';
     b->tokens[1] = NULL;
-    if (*s == '/') {
-        char *instance = t;
-        for (++s; *s != '@'; ++s) {
-            if (*s == '\0' || *s == '/' || t == last) goto fail;
-            *t++ = *s;
+    for (;;) {
+        if (t == end) goto fail;
+        const uint64_t w = text_word(s);
+        const uint64_t m = zero_bytes(w) | zero_bytes(w ^ (ONES * '@')) | zero_bytes(w ^ other);
+        if (m == 0) {
+            *(unaligned_word *)t = w;
+            s += 8;
+            t += 8;
+            continue;
         }
-        if (t == instance) goto fail;
-        *t++ = '\0';
-        b->tokens[1] = instance;
+        const unsigned k = (unsigned)__builtin_ctzll(m) >> 3;
+        *(unaligned_word *)t = k != 0 ? w & (~0ull >> (64 - 8 * k)) : 0;
+        t += 8;
+        s += k;
+        const char c = (char)(w >> (8 * k));
+        if (s == part_begin) goto fail; /* an empty part */
+        if (part == REALM) {
+            if (c != '\0') goto fail;
+            break;
+        }
+        if (c == '/' && part == NAME) {
+            part = INSTANCE;
+            b->tokens[1] = t;
+        } else if (c == '@') {
+            part = REALM;
+            other = ONES * '@';
+            id->rgy = t;
+        } else {
+            goto fail;
+        }
+        part_begin = ++s;
     }
-    char *realm = t;
-    for (++s; *s != '\0'; ++s) {
-        if (*s == '@' || t == last) goto fail;
-        *t++ = *s;
-    }
-    if (t == realm) goto fail;
-    *t++ = '\0';
     sm->in_use = 1;
     b->size = (size_t)(t - (char *)b);
     b->small_in_use = &sm->in_use;
-    b->tokens[0] = b->text;
+    b->tokens[0] = text;
     b->mapping.length = 0;
     b->mapping.value = NULL;
-    id->rgy = realm;
     id->rgy_type = mnemonic;
     id->token_cnt = b->tokens[1] != NULL ? 2 : 1;
     id->tokens = b->tokens;
     return 0;
 fail:
-    explicit_bzero(b->text, (size_t)(t - b->text));
+    explicit_bzero(text, (size_t)(t - text));
     return -1;
 }
 

@@ -1,6 +1,9 @@
 // End to end through libox_idm.so with the two sample plug-ins and real map
 // files: each identity's answer on the first call (rules translated) and on the
 // second (rules from the cache).
+#include <sys/mman.h>
+#include <unistd.h>
+
 #include <cstring>
 #include <string>
 
@@ -55,6 +58,27 @@ TEST(MappingPlugins, HostAndPrincipalIdentities) {
         {"princ", "ann@X/Y.EXAMPLE.ORG", 0, "guest"},  // a realm may hold a '/'
         {"princ", long_princ.c_str(), 0, long_user.c_str()},
     });
+}
+
+// The plug-ins read an id eight bytes at a time: one that ends just before
+// an inaccessible page must be read up to its NUL and no further.
+TEST(MappingPlugins, IdsEndingAtAPageBoundary) {
+    OXTEST_REQUIRE_NAMESPACE();
+    ASSERT_EQ(oxmpm_host_register() + oxmpm_principal_register(), 0);
+    oxtest::write_file(oxtest::kLocalMap, "host:alice@node1=alice\nprinc:joe@EXAMPLE.ORG=joe\n");
+    const size_t page = static_cast<size_t>(sysconf(_SC_PAGESIZE));
+    auto *pages = static_cast<char *>(mmap(nullptr, 2 * page, PROT_READ | PROT_WRITE, MAP_PRIVATE | MAP_ANONYMOUS, -1, 0));
+    ASSERT_NE(pages, MAP_FAILED);
+    ASSERT_EQ(mprotect(pages + page, page, PROT_NONE), 0);
+    for (const char *id : {"alice@node1", "joe@EXAMPLE.ORG"}) {
+        char *at_end = pages + page - std::strlen(id) - 1;
+        std::memcpy(at_end, id, std::strlen(id) + 1);
+        idm_buffer local{};
+        EXPECT_EQ(sec_idm_map_identity(id[0] == 'a' ? "host" : "princ", at_end, &local), 0) << id;
+        EXPECT_STREQ(local.value, id[0] == 'a' ? "alice" : "joe");
+        std::free(local.value);
+    }
+    munmap(pages, 2 * page);
 }
 
 }  // namespace

@@ -186,7 +186,6 @@ int32_t idm__native_map_identity(const char *mnemonic, const char *network_id, i
         const int32_t n = record->entry_count;
         for (int32_t i = 0; i < n; ++i) {
             idm_mapfile_entry *entry = &record->entries[i];
-            idm_rule rule{};
             int32_t match = -1;
             if (int32_t k = entry->rule_index; k != 0) {
                 if (k < 0 || k > record->rule_count) continue;
@@ -196,6 +195,7 @@ int32_t idm__native_map_identity(const char *mnemonic, const char *network_id, i
                 if (status == 0) match = idm__native_apply_rule(cached, &id, local);
                 (void)cleanup(nullptr, &id);
             } else {
+                idm_rule rule{};
                 status = translate(entry, network_id, &rule, &id);
                 switch (status) {
                 case 0:

@@ -32,6 +32,7 @@ inline const char *or_null(const char *s) { return nonempty(s) ? s : kTraceNull;
 // Exact comparison of two short texts (registry types): cheaper inline than
 // a library call for the few bytes they hold.
 inline bool same_text(const char *a, const char *b) {
+    if (a == b) return true;  // a plug-in's rules and ids share its mnemonic
     while (*a == *b) {
         if (*a == '\0') return true;
         ++a;
@@ -70,15 +71,55 @@ void token_line(char (&line)[kLineBuffer], int32_t count, char *const *tokens) {
 
 namespace idm {
 
-bool wildcard_match(const char *pattern, const char *text) {
-    // One pass over the literal prefix: the texts compared here are short,
-    // and most comparisons end at their first characters.
-    const char *p = pattern;
-    const char *t = text;
+// Word-at-a-time scanning.  A word of a text is read only where it cannot
+// cross into the next page, so reading past a text's NUL touches nothing its
+// own page does not hold; the sanitizers would take those bytes for a read of
+// someone else's memory, hence no sanitizer checks in the routine that reads
+// them.
+namespace {
+
+using UnalignedWord = uint64_t __attribute__((may_alias, aligned(1)));
+constexpr uint64_t kOnes = 0x0101010101010101ull;
+constexpr uint64_t kHighs = 0x8080808080808080ull;
+constexpr uint64_t kStars = kOnes * static_cast<unsigned char>(IDM_WILDCARD);
+
+// The high bit of each byte of `w` that is zero (the lowest one is exact:
+// only bytes above a zero byte can be flagged wrongly), and of each byte that
+// is not zero (exact).
+inline uint64_t zero_bytes(uint64_t w) { return (w - kOnes) & ~w & kHighs; }
+inline uint64_t nonzero_bytes(uint64_t w) { return (((w & ~kHighs) + ~kHighs) | w) & kHighs; }
+inline bool word_readable(const char *p) { return (reinterpret_cast<uintptr_t>(p) & 4095) <= 4096 - 8; }
+
+// Advances p and t past their common literal prefix, to the first place
+// where they differ or the pattern holds a NUL or a '*'.
+__attribute__((no_sanitize("address", "thread"))) inline void skip_literal_prefix(const char *&p, const char *&t) {
+    while (word_readable(p) && word_readable(t)) {
+        const uint64_t a = *reinterpret_cast<const UnalignedWord *>(p);
+        const uint64_t b = *reinterpret_cast<const UnalignedWord *>(t);
+        const uint64_t stop = nonzero_bytes(a ^ b) | zero_bytes(a) | zero_bytes(a ^ kStars);
+        if (stop != 0) {
+            const int k = __builtin_ctzll(stop) >> 3;
+            p += k;
+            t += k;
+            return;
+        }
+        p += 8;
+        t += 8;
+    }
     while (*p != IDM_WILDCARD && *p != '\0' && *p == *t) {
         ++p;
         ++t;
     }
+}
+
+}  // namespace
+
+bool wildcard_match(const char *pattern, const char *text) {
+    // One pass over the literal prefix, eight characters at a time: most
+    // comparisons are of equal texts (a realm) or end early (a token).
+    const char *p = pattern;
+    const char *t = text;
+    skip_literal_prefix(p, t);
     if (*p != IDM_WILDCARD) return *p == '\0' && *t == '\0';  // no '*': equal texts only
     // The text begins with the prefix F before the first '*'.
     const char *suffix = p + 1;
@@ -93,6 +134,34 @@ bool wildcard_match(const char *pattern, const char *text) {
 }
 
 }  // namespace idm
+
+namespace {
+
+// The bodies of idm__native_match_rgy and idm__native_match_token, inline in
+// the walk's hot path.
+inline int32_t match_rgy(const char *rule_rgy, const char *id_rgy) {
+    // Both are non-empty after the checks; a null one simply does not match.
+    if (rule_rgy == nullptr || id_rgy == nullptr || !wildcard_match(rule_rgy, id_rgy))
+        return report(kRuleInvalid, kMsg667, rule_rgy != nullptr ? rule_rgy : "", id_rgy != nullptr ? id_rgy : "");
+    return 0;
+}
+
+inline int32_t match_token(const char *rule_token, const char *id_token) {
+    static constexpr const char kName[] = "idm__native_match_token";
+    if (!nonempty(rule_token)) return report_bad_param(kName, 1, hex(rule_token));
+    if (!nonempty(id_token)) return report_bad_param(kName, 2, hex(id_token));
+    if (!wildcard_match(rule_token, id_token)) return report(kRuleInvalid, kMsg666, rule_token, id_token);
+    return 0;
+}
+
+// What idm__native_check_rule and idm__native_check_id let pass without a
+// report: a rule already found valid, an id with all its parts.
+inline bool valid_rule(const idm_rule *rule) { return (rule->rule_state & kLowHalf) == IDM_RULE_VALID; }
+inline bool complete_id(const idm_id *id) {
+    return nonempty(id->rgy_type) && nonempty(id->rgy) && id->token_cnt > 0 && id->tokens != nullptr;
+}
+
+}  // namespace
 
 extern "C" {
 
@@ -123,19 +192,10 @@ int32_t idm__strncmpr(const char *s1, const char *s2, uint32_t n) {
     }
 }
 
-int32_t idm__native_match_rgy(const char *rule_rgy, const char *id_rgy) {
-    // Both are non-empty after the checks; a null one simply does not match.
-    if (rule_rgy == nullptr || id_rgy == nullptr || !wildcard_match(rule_rgy, id_rgy))
-        return report(kRuleInvalid, kMsg667, rule_rgy != nullptr ? rule_rgy : "", id_rgy != nullptr ? id_rgy : "");
-    return 0;
-}
+int32_t idm__native_match_rgy(const char *rule_rgy, const char *id_rgy) { return match_rgy(rule_rgy, id_rgy); }
 
 int32_t idm__native_match_token(const char *rule_token, const char *id_token) {
-    static constexpr const char kName[] = "idm__native_match_token";
-    if (!nonempty(rule_token)) return report_bad_param(kName, 1, hex(rule_token));
-    if (!nonempty(id_token)) return report_bad_param(kName, 2, hex(id_token));
-    if (!wildcard_match(rule_token, id_token)) return report(kRuleInvalid, kMsg666, rule_token, id_token);
-    return 0;
+    return match_token(rule_token, id_token);
 }
 
 int32_t idm__native_check_rule(idm_rule *rule) {
@@ -143,8 +203,8 @@ int32_t idm__native_check_rule(idm_rule *rule) {
     const trace::Api api(kIds, trace::ptr(rule));
     if (api.entered_with_data()) idm__trace_native_rule(rule);
 
+    if (valid_rule(rule)) return api.leave(0);
     uint32_t low = rule->rule_state & kLowHalf;
-    if (low == IDM_RULE_VALID) return api.leave(0);
     if (low == IDM_RULE_UNCHECKED) {
         auto flag = [rule](uint32_t f) { rule->rule_state |= f; };
         if (!nonempty(rule->rgy_type) || !nonempty(rule->rgy)) flag(IDM_RULE_BAD_RGY);
@@ -214,8 +274,7 @@ int32_t idm__native_check_id(idm_id *id) {
     const trace::Api api(kIds, trace::ptr(id));
     if (api.entered_with_data()) idm__trace_native_id(id);
     int32_t status = 0;
-    if (!nonempty(id->rgy_type) || !nonempty(id->rgy) || id->token_cnt <= 0 || id->tokens == nullptr)
-        status = report(kRuleInvalid, kMsg665);
+    if (!complete_id(id)) status = report(kRuleInvalid, kMsg665);
     return api.leave(status);
 }
 
@@ -252,14 +311,19 @@ int32_t idm__native_apply_rule(idm_rule *rule, idm_id *id, idm_buffer *result) {
     static constexpr trace::ApiIds kIds{tp::kApplyEntry, tp::kApplyEntryData, tp::kApplyExit, tp::kApplyExitData};
     trace::Api api(kIds, trace::ptr(rule), trace::ptr(id), trace::ptr(result));
 
-    if (int32_t s = idm__native_check_rule(rule); s != 0) return api.leave(s);
-    if (int32_t s = idm__native_check_id(id); s != 0) return api.leave(s);
+    // With the API trace off, a cached valid rule and a complete id pass the
+    // two checks as their calls would, without the calls: the walk meets
+    // them at nearly every entry.
+    if (trace::level(trace::kApi) != 0 || !valid_rule(rule) || !complete_id(id)) {
+        if (int32_t s = idm__native_check_rule(rule); s != 0) return api.leave(s);
+        if (int32_t s = idm__native_check_id(id); s != 0) return api.leave(s);
+    }
     if (rule->token_cnt != id->token_cnt)
         return api.leave(report(kRuleInvalid, kMsg664, static_cast<int>(rule->token_cnt), static_cast<int>(id->token_cnt)));
     if (!same_text(rule->rgy_type, id->rgy_type)) return api.leave(report(kRuleInvalid, kMsg663));
-    if (int32_t s = idm__native_match_rgy(rule->rgy, id->rgy); s != 0) return api.leave(s);
+    if (int32_t s = match_rgy(rule->rgy, id->rgy); s != 0) return api.leave(s);
     for (int32_t i = 0; i < rule->token_cnt; ++i)
-        if (int32_t s = idm__native_match_token(rule->tokens[i], id->tokens[i]); s != 0) return api.leave(s);
+        if (int32_t s = match_token(rule->tokens[i], id->tokens[i]); s != 0) return api.leave(s);
     if (int32_t s = idm__native_get_mapping(rule, id, result); s != 0) return api.leave(s);
 
     unsigned char l = trace::level(trace::kMapping);

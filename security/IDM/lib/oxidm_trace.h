@@ -103,6 +103,7 @@ class Api {
   public:
     template <class... Items>
     explicit Api(const ApiIds &ids, Items... items) : ids_(ids), entered_(level(kApi)) {
+        if (entered_ == 0) [[likely]] return;
         if (entered_ == 1) record_id(ids_.entry);
         else if (entered_ == 8 && ids_.entry_data == ids_.entry) record_id(ids_.entry);
         else if (entered_ == 8) record_data(ids_.entry_data, items...);
@@ -112,6 +113,7 @@ class Api {
     template <class... Items>
     int32_t leave(int32_t status, Items... more) const {
         const unsigned char l = level(kApi);
+        if (l == 0) [[likely]] return status;
         if (l == 1) record_id(ids_.exit);
         else if (l == 8 && ids_.exit_data == ids_.exit) record_id(ids_.exit);
         else if (l == 8) record_data(ids_.exit_data, i32(status), more...);
