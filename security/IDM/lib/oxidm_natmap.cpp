@@ -114,7 +114,8 @@ __attribute__((no_sanitize("address", "thread"))) inline void skip_literal_prefi
 
 }  // namespace
 
-bool wildcard_match(const char *pattern, const char *text) {
+// The walk compares two texts per entry: the matcher is inlined there.
+[[gnu::always_inline]] inline bool match_wildcard(const char *pattern, const char *text) {
     // One pass over the literal prefix, eight characters at a time: most
     // comparisons are of equal texts (a realm) or end early (a token).
     const char *p = pattern;
@@ -133,6 +134,8 @@ bool wildcard_match(const char *pattern, const char *text) {
     return idm__strncmpr(suffix, text, static_cast<uint32_t>(suffix_len)) == 0;
 }
 
+bool wildcard_match(const char *pattern, const char *text) { return match_wildcard(pattern, text); }
+
 }  // namespace idm
 
 namespace {
@@ -141,7 +144,7 @@ namespace {
 // the walk's hot path.
 inline int32_t match_rgy(const char *rule_rgy, const char *id_rgy) {
     // Both are non-empty after the checks; a null one simply does not match.
-    if (rule_rgy == nullptr || id_rgy == nullptr || !wildcard_match(rule_rgy, id_rgy))
+    if (rule_rgy == nullptr || id_rgy == nullptr || !match_wildcard(rule_rgy, id_rgy))
         return report(kRuleInvalid, kMsg667, rule_rgy != nullptr ? rule_rgy : "", id_rgy != nullptr ? id_rgy : "");
     return 0;
 }
@@ -150,7 +153,7 @@ inline int32_t match_token(const char *rule_token, const char *id_token) {
     static constexpr const char kName[] = "idm__native_match_token";
     if (!nonempty(rule_token)) return report_bad_param(kName, 1, hex(rule_token));
     if (!nonempty(id_token)) return report_bad_param(kName, 2, hex(id_token));
-    if (!wildcard_match(rule_token, id_token)) return report(kRuleInvalid, kMsg666, rule_token, id_token);
+    if (!match_wildcard(rule_token, id_token)) return report(kRuleInvalid, kMsg666, rule_token, id_token);
     return 0;
 }
 
