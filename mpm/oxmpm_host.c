@@ -9,8 +9,8 @@
  * translated once per entry walked and released right after, so it goes
  * into the calling thread's small block when that is free and the id fits,
  * and onto the heap otherwise.  The cleanup routine therefore needs nothing
- * but that pointer: it zeroes the block (it held identities) and frees it
- * or hands the small block back.  `rgy_type` points to the constant mnemonic
+ * but that pointer: it zeroes the block's texts (they held identities) and
+ * frees it or hands the small block back.  `rgy_type` points to the constant mnemonic
  * and is never freed.
  *
  * The routines take no lock; the only state is each thread's small block,
@@ -143,9 +143,21 @@ static void free_block(char **tokens) {
     if (tokens == NULL) return;
     struct block *b = (struct block *)(void *)((char *)tokens - offsetof(struct block, tokens));
     unsigned char *small_in_use = b->small_in_use;
-    explicit_bzero(b, b->size);
-    if (small_in_use == NULL) free(b);
-    else __atomic_store_n(small_in_use, 0, __ATOMIC_RELEASE);
+    if (small_in_use == NULL) {
+        explicit_bzero(b, b->size);
+        free(b);
+        return;
+    }
+    /* The small block's texts are whole words (see fill_id_small), and any
+     * text leaves room for two 16-byte stores: zeroed in line. */
+    typedef char zero16 __attribute__((vector_size(16), may_alias, aligned(1)));
+    const zero16 zero = {0};
+    char *t = b->text;
+    char *const end = (char *)b + b->size;
+    *(zero16 *)t = zero;
+    *(zero16 *)(t + 16) = zero;
+    for (t += 32; t < end; t += 8) *(unaligned_word *)t = 0;
+    __atomic_store_n(small_in_use, 0, __ATOMIC_RELEASE);
 }
 
 static int32_t fill_rule(const idm_mapfile_entry *entry, idm_rule *rule) {
