@@ -1,6 +1,9 @@
 // Rules against ids: the one-wildcard matcher, the rule check and the rule
 // application swept against the reference model (reference.h), and the
 // reports of a failed application in the order the checks run.
+#include <sys/mman.h>
+
+#include <cstring>
 #include <string>
 #include <vector>
 
@@ -53,15 +56,34 @@ Texts atoms(const std::string &word, const Texts &atom) {
     return out;
 }
 
+// A text copied so that its NUL is the last byte before an inaccessible page.
+class AtPageEnd {
+  public:
+    AtPageEnd() : base_(static_cast<char *>(mmap(nullptr, 2 * 4096, PROT_READ | PROT_WRITE, MAP_PRIVATE | MAP_ANONYMOUS, -1, 0))) {
+        mprotect(base_ + 4096, 4096, PROT_NONE);
+    }
+    ~AtPageEnd() { munmap(base_, 2 * 4096); }
+    const char *put(const std::string &s) { return static_cast<char *>(std::memcpy(base_ + 4096 - s.size() - 1, s.c_str(), s.size() + 1)); }
+
+  private:
+    char *base_;
+};
+
 // The matcher and the two reporting routines against the model: a mismatch is
-// a rule failure naming both texts; a missing registry matches nothing.
+// a rule failure naming both texts; a missing registry matches nothing.  The
+// matcher reads eight characters at a time: also behind a long common prefix
+// and with both texts ending at a page's end.
 TEST(NatmapRules, MatcherAgreesWithReference) {
     const Strs all = words("ab*", 4);
+    AtPageEnd pattern_page, text_page;
     for (size_t i = 1; i < all.size(); ++i)
         for (size_t j = 1; j < all.size(); ++j) {
             const std::string &p = all[i], &t = all[j];
             const bool m = ref::match(p, t);
             ASSERT_EQ(idm::wildcard_match(p.c_str(), t.c_str()), m) << p << " " << t;
+            const std::string long_p = "abababab-" + p, long_t = "abababab-" + t;
+            ASSERT_EQ(idm::wildcard_match(long_p.c_str(), long_t.c_str()), ref::match(long_p, long_t)) << long_p << " " << long_t;
+            ASSERT_EQ(idm::wildcard_match(pattern_page.put(long_p), text_page.put(long_t)), ref::match(long_p, long_t));
             ASSERT_EQ(idm__native_match_token(p.c_str(), t.c_str()), m ? idm::kOk : idm::kRuleInvalid) << p << " " << t;
             ASSERT_TRUE(m || reported(idm::kRuleInvalid, idm::kMsg666, {p, t}));
             oxtest::clear_errors();
