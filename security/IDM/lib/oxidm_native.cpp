@@ -247,6 +247,8 @@ static void idm__thread_cleanup_group_scan(void *mutex) {
     idm__thread_cleanup_mutex(mutex);
 }
 
+}  // extern "C"
+
 namespace {
 
 constexpr const char kGroupsName[] = "idm__native_get_groups";
@@ -460,6 +462,8 @@ int32_t scan_groups(const char *name, size_t gr_size, bool primary, WorkArea &wo
 }
 
 }  // namespace
+
+extern "C" {
 
 // The groups of local user user->value: the primary group first (none when
 // the primary group id is -1), then every group whose member list names the
