@@ -84,9 +84,10 @@ extern "C" int getpwnam_r(const char *name, passwd *entry, char *buffer, size_t 
 }
 
 // While g_no_suggestion is set, the system suggests no lookup buffer sizes.
+// The sanitizer runtimes call this before they are ready: no instrumentation.
 extern "C" long __sysconf(int name);
-extern "C" long sysconf(int name) {
-    if (g_no_suggestion.load() && (name == _SC_GETPW_R_SIZE_MAX || name == _SC_GETGR_R_SIZE_MAX)) return -1;
+extern "C" __attribute__((no_sanitize("thread", "address"))) long sysconf(int name) {
+    if ((name == _SC_GETPW_R_SIZE_MAX || name == _SC_GETGR_R_SIZE_MAX) && g_no_suggestion.load()) return -1;
     return __sysconf(name);
 }
 
