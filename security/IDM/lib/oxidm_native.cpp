@@ -247,6 +247,8 @@ static void idm__thread_cleanup_group_scan(void *mutex) {
     idm__thread_cleanup_mutex(mutex);
 }
 
+}  // extern "C"
+
 namespace {
 
 constexpr const char kGroupsName[] = "idm__native_get_groups";
@@ -281,32 +283,86 @@ class GroupScanHold : Pinned {
     ~GroupScanHold() { idm::forget_dead_frames(); idm__thread_cleanup_group_scan(&idm__native_group_scan_mutex); }
 };
 
-// A lookup work buffer.  It holds database entries (user names, home
-// directories), so it is zeroed before it is freed, also on cancellation.
-struct WorkBuffer : Pinned {
-    char *p = nullptr;
-    size_t n = 0;
-    WorkBuffer() = default;
-    ~WorkBuffer() { release(); }
-    // 0, or 6 (2650-654 with the size).
-    int32_t allocate(size_t size) {
-        p = static_cast<char *>(xmalloc(size));
-        if (p == nullptr) return report_no_memory(kGroupsName, size);
-        n = size;
+// One failure point of the allocation seam where no block is allocated:
+// the fault-injection build fails it in its turn, so that a lookup keeps the
+// failure points (and the reports) of one allocation per work buffer and per
+// appended element whatever the blocks underneath do.
+bool seam_refuses() {
+#ifdef OXIDM_FAULT_INJECTION
+    return fault_alloc_fires();
+#else
+    return false;
+#endif
+}
+
+// The work space of the three lookups.  The user lookup, the primary group
+// lookup and the scan run one after the other, and none reads the entry of
+// the one before (the primary group's name is copied into the result before
+// the scan), so one region serves all three; each call is given exactly the
+// size it is defined with.  With the usual suggested sizes the region is on
+// the stack; a larger size takes a heap block, replaced when a later lookup
+// needs more.  It holds database entries (user names, home directories), so
+// every byte handed out is zeroed when the region is released, also on
+// cancellation.
+class WorkArea : Pinned {
+  public:
+    WorkArea() = default;
+    ~WorkArea() {
+        idm::forget_dead_frames();
+        release();
+    }
+    // Makes data() a buffer of `size` bytes for the next lookup: 0, or 6
+    // (2650-654 with the size).
+    int32_t take(size_t size) {
+        if (size <= capacity_) {
+            if (seam_refuses()) return report_no_memory(kGroupsName, size);
+        } else {
+            release();
+            heap_ = static_cast<char *>(xmalloc(size));
+            if (heap_ == nullptr) return report_no_memory(kGroupsName, size);
+            data_ = heap_;
+            capacity_ = size;
+        }
+        if (size > used_) used_ = size;
         return 0;
     }
+    char *data() const { return data_; }
+
+  private:
+    static constexpr size_t kStackBytes = 4096;
+
     void release() {
-        free_zeroed(p, n);
-        p = nullptr;
-        n = 0;
+        if (heap_ != nullptr) {
+            free_zeroed(heap_, used_);
+            heap_ = nullptr;
+        } else if (used_ != 0) {
+            explicit_bzero(stack_, used_);
+#ifdef OXIDM_FAULT_INJECTION
+            fault_note_secret_free(stack_, used_);
+#endif
+        }
+        data_ = stack_;
+        capacity_ = kStackBytes;
+        used_ = 0;
     }
+
+    char stack_[kStackBytes];
+    char *data_ = stack_;
+    char *heap_ = nullptr;
+    size_t capacity_ = kStackBytes;
+    size_t used_ = 0;
 };
 
 // The result array under construction.  Unless handed over, the destructor
 // frees every element's value and then the array.
 struct GroupList : Pinned {
+    // Elements the array block has room for before it is first enlarged:
+    // more than most users' groups.
+    static constexpr size_t kFirstCapacity = 16;
+
     idm_buffer *items = nullptr;
     uint32_t count = 0;
+    size_t capacity = 0;
     GroupList() = default;
     ~GroupList() {
         for (uint32_t i = 0; i < count; ++i) std::free(items[i].value);
@@ -314,17 +370,32 @@ struct GroupList : Pinned {
     }
     // Appends a zeroed element and copies `name` into it.  Returns 0 or 6
     // (2650-654): when the array cannot grow it stays as it was; when the
-    // name cannot be copied the zeroed element stays, counted.
+    // name cannot be copied the zeroed element stays, counted.  The array
+    // grows by one element per append as far as failures and their sizes
+    // go, while its block grows geometrically, so appending stays cheap.
     int32_t append(const char *name) {
-        size_t bytes = (static_cast<size_t>(count) + 1) * sizeof(idm_buffer);
-        void *grown = items == nullptr ? xmalloc(bytes) : xrealloc(items, bytes);
-        if (grown == nullptr) return report_no_memory(kGroupsName, bytes);
-        items = static_cast<idm_buffer *>(grown);
+        const size_t bytes = (static_cast<size_t>(count) + 1) * sizeof(idm_buffer);
+        if (count < capacity) {
+            if (seam_refuses()) return report_no_memory(kGroupsName, bytes);
+        } else {
+            size_t room = capacity == 0 ? kFirstCapacity : 2 * capacity;
+            void *grown = xrealloc(items, room * sizeof(idm_buffer));
+#ifndef OXIDM_FAULT_INJECTION
+            if (grown == nullptr) {  // short of memory: the one element is still worth a try
+                room = static_cast<size_t>(count) + 1;
+                grown = xrealloc(items, bytes);
+            }
+#endif
+            if (grown == nullptr) return report_no_memory(kGroupsName, bytes);
+            items = static_cast<idm_buffer *>(grown);
+            capacity = room;
+        }
         idm_buffer *added = &items[count++];
         std::memset(added, 0, sizeof *added);
-        size_t length = std::strlen(name) + 1;
-        added->value = xstrdup(name);
+        const size_t length = std::strlen(name) + 1;
+        added->value = static_cast<char *>(xmalloc(length));
         if (added->value == nullptr) return report_no_memory(kGroupsName, length);
+        std::memcpy(added->value, name, length);
         added->length = static_cast<uint32_t>(length);
         return 0;
     }
@@ -333,29 +404,25 @@ struct GroupList : Pinned {
 // User lookup and primary group: on 0, `list` holds the primary group as its
 // only element unless the user's primary group id is -1 (`*primary` tells).
 // Returns 0, 6 (2650-654) or 15 (2650-698, 2650-699).
-int32_t lookup_primary_group(const char *name, size_t pw_size, size_t gr_size, GroupList &list, bool *primary) {
-    WorkBuffer user_buffer;
-    if (int32_t status = user_buffer.allocate(2 * pw_size); status != 0) return status;
+int32_t lookup_primary_group(const char *name, size_t pw_size, size_t gr_size, WorkArea &work, GroupList &list,
+                             bool *primary) {
+    if (int32_t status = work.take(2 * pw_size); status != 0) return status;
     passwd pwd;
     passwd *user = nullptr;
-    int result = getpwnam_r(name, &pwd, user_buffer.p, user_buffer.n, &user);
+    int result = getpwnam_r(name, &pwd, work.data(), 2 * pw_size, &user);
     if (result != 0 || user == nullptr || std::strncmp(pwd.pw_name, name, pw_size) != 0)
         return report(kGroupsUnavailable, kMsg698, name);
-    if (pwd.pw_gid == static_cast<gid_t>(-1)) return 0;
+    const gid_t gid = pwd.pw_gid;
+    if (gid == static_cast<gid_t>(-1)) return 0;
 
-    WorkBuffer group_buffer;
-    if (int32_t status = group_buffer.allocate(gr_size); status != 0) return status;
+    // The group entry may overwrite the user entry: only its group id is
+    // needed from here on.
+    if (int32_t status = work.take(gr_size); status != 0) return status;
     group grp;
     group *found = nullptr;
-    result = getgrgid_r(pwd.pw_gid, &grp, group_buffer.p, group_buffer.n, &found);
-    if (result != 0 || found == nullptr) return report(kGroupsUnavailable, kMsg699, static_cast<int>(pwd.pw_gid));
-    list.items = static_cast<idm_buffer *>(xcalloc(1, sizeof(idm_buffer)));
-    if (list.items == nullptr) return report_no_memory(kGroupsName, sizeof(idm_buffer));
-    size_t length = std::strlen(grp.gr_name) + 1;
-    list.items[0].value = xstrdup(grp.gr_name);
-    if (list.items[0].value == nullptr) return report_no_memory(kGroupsName, length);
-    list.items[0].length = static_cast<uint32_t>(length);
-    list.count = 1;
+    result = getgrgid_r(gid, &grp, work.data(), gr_size, &found);
+    if (result != 0 || found == nullptr) return report(kGroupsUnavailable, kMsg699, static_cast<int>(gid));
+    if (int32_t status = list.append(grp.gr_name); status != 0) return status;
     *primary = true;
     return 0;
 }
@@ -363,17 +430,17 @@ int32_t lookup_primary_group(const char *name, size_t pw_size, size_t gr_size, G
 // One pass over the group database, appending every group whose member list
 // names `name`, once per naming.  Returns the status of the last failure
 // recorded: 0, 6 (2650-654, the scan went on) or 15 (2650-700, it ended).
-int32_t scan_groups(const char *name, size_t gr_size, bool primary, GroupList &list) {
-    WorkBuffer scan_buffer;
-    if (int32_t status = scan_buffer.allocate(gr_size); status != 0) return status;
+int32_t scan_groups(const char *name, size_t gr_size, bool primary, WorkArea &work, GroupList &list) {
+    if (int32_t status = work.take(gr_size); status != 0) return status;
+    char *const buffer = work.data();
     int32_t status = 0;
-    GroupScanHold scan;  // destroyed first: endgrent and unlock, then the buffer
+    GroupScanHold scan;  // endgrent and unlock when the scan ends
     setgrent();
     for (;;) {
         group grp;
         group *found = nullptr;
         errno = 0;
-        int result = getgrent_r(&grp, scan_buffer.p, scan_buffer.n, &found);
+        int result = getgrent_r(&grp, buffer, gr_size, &found);
         if (result != 0) {
             int error = enumeration_error(result);
             if (error == EINTR) continue;
@@ -396,6 +463,8 @@ int32_t scan_groups(const char *name, size_t gr_size, bool primary, GroupList &l
 
 }  // namespace
 
+extern "C" {
+
 // The groups of local user user->value: the primary group first (none when
 // the primary group id is -1), then every group whose member list names the
 // user, in enumeration order, once per naming; the primary group is not
@@ -412,9 +481,10 @@ int32_t idm__native_get_groups(idm_buffer *user, uint32_t *count, idm_buffer **g
     const size_t gr_size = suggested_size(_SC_GETGR_R_SIZE_MAX);
 
     GroupList list;
+    WorkArea work;
     bool primary = false;
-    int32_t status = lookup_primary_group(user->value, pw_size, gr_size, list, &primary);
-    if (status == 0) status = scan_groups(user->value, gr_size, primary, list);
+    int32_t status = lookup_primary_group(user->value, pw_size, gr_size, work, list, &primary);
+    if (status == 0) status = scan_groups(user->value, gr_size, primary, work, list);
     if (status == 0 && list.count != 0) {
         *groups = list.items;
         *count = list.count;
