@@ -378,14 +378,8 @@ struct GroupList : Pinned {
         if (count < capacity) {
             if (seam_refuses()) return report_no_memory(kGroupsName, bytes);
         } else {
-            size_t room = capacity == 0 ? kFirstCapacity : 2 * capacity;
+            const size_t room = capacity == 0 ? kFirstCapacity : 2 * capacity;
             void *grown = xrealloc(items, room * sizeof(idm_buffer));
-#ifndef OXIDM_FAULT_INJECTION
-            if (grown == nullptr) {  // short of memory: the one element is still worth a try
-                room = static_cast<size_t>(count) + 1;
-                grown = xrealloc(items, bytes);
-            }
-#endif
             if (grown == nullptr) return report_no_memory(kGroupsName, bytes);
             items = static_cast<idm_buffer *>(grown);
             capacity = room;
