@@ -392,6 +392,19 @@ namespace {
 
 // ---- tree records ----
 
+// The order of both trees: the keys' bytes as unsigned char, as strcmp.
+// Keys are short and differ early; a plain loop the search can inline costs
+// less than the call.
+inline int compare_keys(const void *probe, const void *stored) {
+    const auto *a = reinterpret_cast<const unsigned char *>(static_cast<const idm_clnode *>(probe)->key);
+    const auto *b = reinterpret_cast<const unsigned char *>(static_cast<const idm_clnode *>(stored)->key);
+    while (*a == *b && *a != 0) {
+        ++a;
+        ++b;
+    }
+    return int{*a} - int{*b};
+}
+
 // A tree record is one heap block, so that the cleanup routine frees it
 // with one call and a search finds the key in the line it reads the record
 // from:
@@ -831,9 +844,11 @@ int32_t sec__get_cluster_names(MapHold &hold, const char *host, char ***clusters
     idm_clnode probe{const_cast<char *>(host), nullptr, 0};
     rst_tree *tree = idm::clmap::is_address(host) ? &iptree : &nametree;
     status = idm::clmap::kNotFound;
-    void *item = &probe;
-    if (tree->rst_node_cnt != 0 && sec__rst_find(tree, &item) == 1) {
-        const auto *found = static_cast<const idm_clnode *>(item);
+    // Both trees order by idm__rtree_compare_routine, whose body the search
+    // takes inline.
+    const auto *found = static_cast<const idm_clnode *>(
+        rst_search(tree, &probe, [](const void *p, const void *stored) { return idm::clmap::compare_keys(p, stored); }));
+    if (found != nullptr) {
         *clusters = found->clusters;
         *count = found->count;
         status = 0;
@@ -880,9 +895,7 @@ void idm__free_arrays(char **array, int32_t count) {
     }
 }
 
-int idm__rtree_compare_routine(const void *probe, const void *stored) {
-    return std::strcmp(static_cast<const idm_clnode *>(probe)->key, static_cast<const idm_clnode *>(stored)->key);
-}
+int idm__rtree_compare_routine(const void *probe, const void *stored) { return idm::clmap::compare_keys(probe, stored); }
 
 // The record, its key, its array and its names are one block.
 void idm__rtree_cleanup_routine(void *item) { std::free(item); }
