@@ -13,9 +13,9 @@
 // reload rebuilds both trees from scratch, so the last one wins.
 //
 // The file is read whole with one read() into a buffer of its size + 1, an
-// LF is appended, and parse() judges the text in place.  Values are copied
-// once out of the text, and the record's cluster list once more into each
-// tree record.
+// LF is appended, and parse() judges the text in place.  The working lists
+// hold views into that text; a value is copied only into the tree records
+// that hold it, each record one heap block.
 #include "oxidm_clmap.h"
 
 #include <arpa/inet.h>
@@ -390,18 +390,99 @@ char *copy_value(const char *begin, size_t length) {
 
 namespace {
 
+// ---- tree records ----
+
+// The heap's geometry (glibc): a block of n bytes takes a chunk of n + 8
+// bytes rounded up to 16, at least 32.
+constexpr size_t heap_chunk(size_t n) { return n + 8 <= 32 ? 32 : (n + 8 + 15) & ~size_t{15}; }
+
+// The order of both trees: the keys' bytes as unsigned char, as strcmp.
+// Keys are short and differ early; a plain loop the search can inline costs
+// less than the call.
+inline int compare_keys(const void *probe, const void *stored) {
+    const auto *a = reinterpret_cast<const unsigned char *>(static_cast<const idm_clnode *>(probe)->key);
+    const auto *b = reinterpret_cast<const unsigned char *>(static_cast<const idm_clnode *>(stored)->key);
+    while (*a == *b && *a != 0) {
+        ++a;
+        ++b;
+    }
+    return int{*a} - int{*b};
+}
+
+// A tree record is one heap block, so that the cleanup routine frees it
+// with one call and a search finds the key in the line it reads the record
+// from:
+//   idm_clnode | key and NUL | padding | char *[count] | each name and NUL
+// `name(i)` gives the i-th cluster name (a view whose data is null for an
+// entry left null).  0, or 6 after reporting 2650-654 for idm__getnode with
+// the block's size.
+//
+// `node_follows`: the record goes into a tree next, whose insertion
+// allocates the tree node.  The block is then taken a tree node's chunk
+// larger and shrunk in place, which leaves exactly that chunk free right
+// behind the record, first in line for the node's allocation.  A search
+// then finds each node beside its record (one page, often one pair of
+// lines) whatever pieces earlier loads left in the heap; without this a
+// reload builds its trees in the scattered pieces of the trees before, and
+// searches in them took about a third longer.  With another allocator the shrink
+// is merely a shrink.
+template <class Name>
+int32_t new_record(std::string_view key, int32_t count, Name name, idm_clnode **node, bool node_follows = false) {
+    static constexpr size_t kAlign = alignof(char *);
+    const size_t array_at = (sizeof(idm_clnode) + key.size() + 1 + kAlign - 1) & ~(kAlign - 1);
+    size_t bytes = array_at + static_cast<size_t>(count) * sizeof(char *);
+    bool overflow = false;
+    for (int32_t i = 0; i < count; ++i) {
+        const std::string_view c = name(i);
+        if (c.data() != nullptr) overflow |= __builtin_add_overflow(bytes, c.size() + 1, &bytes);
+    }
+    const size_t asked = node_follows && !overflow ? heap_chunk(bytes) - 8 + heap_chunk(sizeof(rst_node)) : bytes;
+    auto *block = overflow ? nullptr : static_cast<char *>(xmalloc(asked));
+    if (block == nullptr) {
+        *node = nullptr;
+        return report_no_memory("idm__getnode", overflow ? SIZE_MAX : bytes);
+    }
+    if (asked != bytes)
+        if (void *shrunk = std::realloc(block, bytes)) block = static_cast<char *>(shrunk);
+    auto *n = reinterpret_cast<idm_clnode *>(block);
+    n->key = block + sizeof(idm_clnode);
+    std::memcpy(n->key, key.data(), key.size());
+    n->key[key.size()] = '\0';
+    n->clusters = nullptr;
+    n->count = count;
+    if (count > 0) {
+        n->clusters = reinterpret_cast<char **>(block + array_at);
+        char *to = block + array_at + static_cast<size_t>(count) * sizeof(char *);
+        for (int32_t i = 0; i < count; ++i) {
+            const std::string_view c = name(i);
+            if (c.data() == nullptr) {
+                n->clusters[i] = nullptr;
+                continue;
+            }
+            n->clusters[i] = to;
+            std::memcpy(to, c.data(), c.size());
+            to[c.size()] = '\0';
+            to += c.size() + 1;
+        }
+    }
+    *node = n;
+    return 0;
+}
+
 // ---- building the trees from the parse ----
 
-// One working list of value copies (names, addresses or clusters).
+// One working list of values (names, addresses or clusters): views into the
+// text being parsed, each cut at its first NUL as a C string would be.
 struct WorkList {
-    char **values = nullptr;
+    std::string_view *values = nullptr;
     int32_t count = 0;
     int32_t capacity = 0;
 };
 
 // The parse's sink while loading: the three working lists and the record
-// store.  Owns the lists and every value still in them; the destructor (also
-// the cancellation clean-up) releases them.
+// store.  Owns the lists; the destructor (also the cancellation clean-up)
+// releases them.  The values stay in the text, which outlives the parse, and
+// are copied once, into each tree record that holds them.
 class Builder : Pinned {
   public:
     explicit Builder(size_t text_size)
@@ -412,10 +493,10 @@ class Builder : Pinned {
     int32_t allocate_lists() {
         static constexpr int32_t kSites[3] = {kSiteNames, kSiteAddresses, kSiteClusters};
         for (int a = 0; a < 3; ++a) {
-            lists_[a].values = static_cast<char **>(xcalloc(kListStep, sizeof(char *)));
+            lists_[a].values = static_cast<std::string_view *>(xmalloc(kListStep * sizeof(std::string_view)));
             if (lists_[a].values == nullptr) {
-                report_no_memory("idm__construct_clcfg", kListStep * sizeof(char *));
-                trace_alloc_failure(kSites[a], kListStep * sizeof(char *));
+                report_no_memory("idm__construct_clcfg", kListStep * sizeof(std::string_view));
+                trace_alloc_failure(kSites[a], kListStep * sizeof(std::string_view));
                 return kNoMemory;
             }
             lists_[a].capacity = kListStep;
@@ -425,7 +506,6 @@ class Builder : Pinned {
 
     void release() {
         for (WorkList &l : lists_) {
-            if (l.values != nullptr) idm__free_arrays(l.values, l.capacity);
             std::free(l.values);
             l = WorkList{};
         }
@@ -445,9 +525,9 @@ class Builder : Pinned {
 
     int32_t add_value(Attr attr, std::string_view value) {
         WorkList &l = lists_[attr];
-        char *copy = copy_value(value.data(), value.size());
-        if (copy == nullptr) return kNoMemory;
-        l.values[l.count++] = copy;
+        if (const void *nul = std::memchr(value.data(), '\0', value.size()))
+            value = value.substr(0, static_cast<size_t>(static_cast<const char *>(nul) - value.data()));
+        l.values[l.count++] = value;
         if (l.count == l.capacity) return grow(attr);
         return 0;
     }
@@ -456,39 +536,45 @@ class Builder : Pinned {
         static constexpr int32_t kSites[3] = {kSiteGrowNames, kSiteGrowAddresses, kSiteGrowClusters};
         WorkList &l = lists_[attr];
         const size_t capacity = static_cast<size_t>(l.capacity) + kListStep;
-        const size_t bytes = capacity * sizeof(char *);
-        auto **grown = static_cast<char **>(xrealloc(l.values, bytes));
+        const size_t bytes = capacity * sizeof(std::string_view);
+        auto *grown = static_cast<std::string_view *>(xrealloc(l.values, bytes));
         if (grown == nullptr) {
             report_no_memory("idm__construct_clcfg", bytes);
             trace_alloc_failure(kSites[attr], bytes);
             return kNoMemory;
         }
-        std::memset(grown + l.capacity, 0, kListStep * sizeof(char *));
         l.values = grown;
         l.capacity = static_cast<int32_t>(capacity);
         return 0;
     }
 
-    void trace_record() const {
+    // The record's values for the diagnostic trace, each as a text of its
+    // own (made only at that level; a copy that cannot be made fails the
+    // load as the value's copy would).
+    int32_t trace_record() const {
         trace::record_id(tp::kNodeRecordComplete);
         static constexpr trace::tp::Id kPoints[3] = {tp::kNodeRecordName, tp::kNodeRecordAddress, tp::kNodeRecordCluster};
         for (int a = 0; a < 3; ++a)
             for (int32_t i = 0; i < lists_[a].count; ++i) {
-                const char *v = lists_[a].values[i];
-                trace::record_data(kPoints[a], trace::i32(i), trace::text(v != nullptr ? v : kNullValue));
+                const std::string_view v = lists_[a].values[i];
+                char *copy = copy_value(v.data(), v.size());
+                if (copy == nullptr) return kNoMemory;
+                trace::record_data(kPoints[a], trace::i32(i), trace::text(copy));
+                std::free(copy);
             }
+        return 0;
     }
 
     // Makes the tree record of one key within the record budget.
-    int32_t make_node(const char *key, size_t cluster_bytes, idm_clnode **node) {
+    int32_t make_node(std::string_view key, size_t cluster_bytes, idm_clnode **node) {
         const WorkList &clusters = lists_[kClusters];
-        const size_t need = sizeof(idm_clnode) + std::strlen(key) + 1 + cluster_bytes;
+        const size_t need = sizeof(idm_clnode) + key.size() + 1 + cluster_bytes;
         if (need > record_budget_ - record_spent_) {
             *node = nullptr;
             return report_no_memory("idm__getnode", static_cast<size_t>(clusters.count) * sizeof(char *));
         }
         record_spent_ += need;
-        return idm__getnode(key, clusters.values, clusters.count, node);
+        return new_record(key, clusters.count, [&](int32_t i) { return clusters.values[i]; }, node, true);
     }
 
     // Stores one record per value of `attr` into `tree`; the first record
@@ -496,11 +582,10 @@ class Builder : Pinned {
     int32_t store_keys(Attr attr, rst_tree *tree, const char *label, size_t cluster_bytes) {
         const WorkList &keys = lists_[attr];
         for (int32_t i = 0; i < keys.count; ++i) {
-            const char *key = keys.values[i];
+            const std::string_view key = keys.values[i];
             idm_clnode *node = nullptr;
             if (make_node(key, cluster_bytes, &node) != 0) {
-                if (trace::diag_on())
-                    trace::record_data(tp::kNodeNoTreeRecord, trace::text(label), trace::text(*key != '\0' ? key : kNullValue));
+                if (trace::diag_on()) trace_no_record(label, key);
                 return kNoMemory;
             }
             void *item = node;
@@ -515,17 +600,28 @@ class Builder : Pinned {
         return 0;
     }
 
+    // Trace point kNodeNoTreeRecord for a key: its text needs a copy of its
+    // own, which is not reported when it cannot be made (the load is
+    // failing already).
+    static void trace_no_record(const char *label, std::string_view key) {
+        char *copy = key.empty() ? nullptr : static_cast<char *>(xmalloc(key.size() + 1));
+        if (copy != nullptr) {
+            std::memcpy(copy, key.data(), key.size());
+            copy[key.size()] = '\0';
+        }
+        trace::record_data(tp::kNodeNoTreeRecord, trace::text(label), trace::text(copy, kNullValue));
+        std::free(copy);
+    }
+
     int32_t store_record() {
-        if (trace::diag_on()) trace_record();
+        if (trace::diag_on())
+            if (int32_t s = trace_record()) return s;
         const WorkList &clusters = lists_[kClusters];
         size_t cluster_bytes = static_cast<size_t>(clusters.count) * sizeof(char *);
-        for (int32_t i = 0; i < clusters.count; ++i) cluster_bytes += std::strlen(clusters.values[i]) + 1;
+        for (int32_t i = 0; i < clusters.count; ++i) cluster_bytes += clusters.values[i].size() + 1;
         if (int32_t s = store_keys(kNames, &nametree, "NAME", cluster_bytes)) return s;
         if (int32_t s = store_keys(kAddresses, &iptree, "ADDRESS", cluster_bytes)) return s;
-        for (WorkList &l : lists_) {
-            idm__free_arrays(l.values, l.count);
-            l.count = 0;
-        }
+        for (WorkList &l : lists_) l.count = 0;
         return 0;
     }
 
@@ -761,18 +857,19 @@ int32_t sec__get_cluster_names(MapHold &hold, const char *host, char ***clusters
     int32_t status = idm__read_clmap_file(hold);
     if (status != 0) return api.leave(status);
     if (host == nullptr) return api.leave(idm::clmap::kNotFound);
-    idm_clnode *probe = nullptr;
-    if (idm__getnode(host, nullptr, 0, &probe) != 0) return api.leave(6);
+    // The probe is only compared (by its key): it lives on the stack.
+    idm_clnode probe{const_cast<char *>(host), nullptr, 0};
     rst_tree *tree = idm::clmap::is_address(host) ? &iptree : &nametree;
     status = idm::clmap::kNotFound;
-    void *item = probe;
-    if (tree->rst_node_cnt != 0 && sec__rst_find(tree, &item) == 1) {
-        const auto *found = static_cast<const idm_clnode *>(item);
+    // Both trees order by idm__rtree_compare_routine, whose body the search
+    // takes inline.
+    const auto *found = static_cast<const idm_clnode *>(
+        rst_search(tree, &probe, [](const void *p, const void *stored) { return idm::clmap::compare_keys(p, stored); }));
+    if (found != nullptr) {
         *clusters = found->clusters;
         *count = found->count;
         status = 0;
     }
-    idm__rtree_cleanup_routine(probe);
     return api.leave(status);
 }
 
@@ -802,37 +899,9 @@ int32_t idm__getnode(const char *key, char **clusters, int32_t count, idm_clnode
     if (key == nullptr) return report_bad_internal_param(kInternal, kName, 1, hex(key));
     if (count < 0 || (count > 0 && clusters == nullptr))
         return report_bad_internal_param(kInternal, kName, 3, hex(static_cast<uintptr_t>(static_cast<intptr_t>(count))));
-    auto *n = static_cast<idm_clnode *>(xmalloc(sizeof(idm_clnode)));
-    if (n == nullptr) return report_no_memory(kName, sizeof(idm_clnode));
-    *n = idm_clnode{nullptr, nullptr, 0};
-    const size_t key_length = std::strlen(key);
-    n->key = static_cast<char *>(xmalloc(key_length + 1));
-    if (n->key == nullptr) {
-        idm__rtree_cleanup_routine(n);
-        return report_no_memory(kName, key_length);
-    }
-    std::memcpy(n->key, key, key_length + 1);
-    if (count > 0) {
-        n->clusters = static_cast<char **>(xmalloc(static_cast<size_t>(count) * sizeof(char *)));
-        if (n->clusters == nullptr) {
-            idm__rtree_cleanup_routine(n);
-            return report_no_memory(kName, static_cast<size_t>(count) * sizeof(char *));
-        }
-        for (int32_t i = 0; i < count; ++i) n->clusters[i] = nullptr;
-        n->count = count;
-        for (int32_t i = 0; i < count; ++i) {
-            if (clusters[i] == nullptr) continue;
-            const size_t length = std::strlen(clusters[i]);
-            n->clusters[i] = static_cast<char *>(xmalloc(length + 1));
-            if (n->clusters[i] == nullptr) {
-                idm__rtree_cleanup_routine(n);
-                return report_no_memory(kName, length);
-            }
-            std::memcpy(n->clusters[i], clusters[i], length + 1);
-        }
-    }
-    *node = n;
-    return 0;
+    return idm::clmap::new_record(key, count, [clusters](int32_t i) {
+        return clusters[i] != nullptr ? std::string_view(clusters[i]) : std::string_view();
+    }, node);
 }
 
 void idm__free_arrays(char **array, int32_t count) {
@@ -843,20 +912,10 @@ void idm__free_arrays(char **array, int32_t count) {
     }
 }
 
-int idm__rtree_compare_routine(const void *probe, const void *stored) {
-    return std::strcmp(static_cast<const idm_clnode *>(probe)->key, static_cast<const idm_clnode *>(stored)->key);
-}
+int idm__rtree_compare_routine(const void *probe, const void *stored) { return idm::clmap::compare_keys(probe, stored); }
 
-void idm__rtree_cleanup_routine(void *item) {
-    auto *n = static_cast<idm_clnode *>(item);
-    if (n == nullptr) return;
-    std::free(n->key);
-    if (n->clusters != nullptr) {
-        idm__free_arrays(n->clusters, n->count);
-        std::free(n->clusters);
-    }
-    std::free(n);
-}
+// The record, its key, its array and its names are one block.
+void idm__rtree_cleanup_routine(void *item) { std::free(item); }
 
 __attribute__((visibility("default"))) void sec__idm_clmap_init(void) {
     static constexpr trace::ApiIds kIds{tp::kClmapInitEntry, tp::kClmapInitEntry, tp::kClmapInitExit, tp::kClmapInitExit};

@@ -50,10 +50,13 @@
 
 // One tree entry: a host name (nametree) or address text (iptree) and a copy
 // of its record's cluster names in file order.  Every stored record has a
-// count of at least 1; only a lookup's probe has count 0 and no array.
+// count of at least 1; only a lookup's probe has count 0 and no array.  A
+// record made by idm__getnode is one heap block holding the key, the array
+// and the names after the fields (so the key shares the record's first
+// cache line); a probe is the caller's and points at the caller's key.
 struct idm_clnode {
-    char *key;        // owned; the tree key, exactly as written in the file
-    char **clusters;  // owned array of `count` owned strings, or null
+    char *key;        // the tree key, exactly as written in the file
+    char **clusters;  // array of `count` strings, or null
     int32_t count;
 };
 
@@ -191,15 +194,17 @@ extern int64_t lastmod;                              // atomically accessed
 // (*consumed is the LF's offset; 2650-690 reported).  6: no memory
 // (2650-654 reported).
 int32_t idm__extract_attr_value(const char *text, int32_t *consumed, char **attr_value, char terminator);
-// 0: *node is a new record with a copy of key and, for count > 0, a new
-// array of count entries copying each non-null entry of clusters.  6: no
-// memory (2650-654 reported, *node null, nothing left allocated).
+// 0: *node is a new record with a copy of key and, for count > 0, an array
+// of count entries copying each non-null entry of clusters (a null entry
+// stays null), all in one block.  6: no memory (2650-654 reported with the
+// block's size, *node null, nothing left allocated).
 int32_t idm__getnode(const char *key, char **clusters, int32_t count, idm_clnode **node);
 // Frees each non-null entry of the first count entries and nulls it.
 void idm__free_arrays(char **array, int32_t count);
 // strcmp of the two records' keys.
 int idm__rtree_compare_routine(const void *probe, const void *stored);
-// Frees a record with its key, cluster strings and array; null is ignored.
+// Frees a record made by idm__getnode (its one block: key, cluster strings
+// and array with it); null is ignored.
 void idm__rtree_cleanup_routine(void *node);
 
 }  // extern "C"

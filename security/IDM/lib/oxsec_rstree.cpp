@@ -1,7 +1,7 @@
 // Randomized search tree (see oxsec_rstree.h).  Insertion, the array walk
 // and the clean walk recurse once per level; random priorities keep the
-// expected height logarithmic whatever the order of insertion.  Search and
-// deletion walk iteratively.
+// expected height logarithmic whatever the order of insertion.  Search (in
+// the header, rst_search) and deletion walk iteratively.
 //
 // The node-count assertion of sec__rst_array holds in every build, so the
 // declaration of the assertion routine is wanted even under NDEBUG.
@@ -18,14 +18,6 @@
 namespace {
 
 bool usable(const rst_tree *tree) { return tree != nullptr && tree->rst_magic == kRstMagic; }
-
-// Asks for the cache lines a search reaching `n` will read next: its object
-// and its children.
-inline void fetch_ahead(const rst_node *n) {
-    __builtin_prefetch(n->object);
-    __builtin_prefetch(n->left);
-    __builtin_prefetch(n->right);
-}
 
 // The left child takes n's place; n becomes its right child.
 void rotate_right(rst_node **link) {
@@ -58,8 +50,8 @@ int rst_insert_recurse(rst_tree *tree, rst_node **link, void **object) {
         tree->rst_node_cnt++;
         return 1;
     }
-    if (n->left != nullptr) fetch_ahead(n->left);  // as in sec__rst_find
-    if (n->right != nullptr) fetch_ahead(n->right);
+    if (n->left != nullptr) rst_fetch_ahead(n->left);  // as in rst_search
+    if (n->right != nullptr) rst_fetch_ahead(n->right);
     int r = tree->rst_compare(*object, n->object);
     if (r == 0) {
         *object = n->object;
@@ -123,22 +115,10 @@ int sec__rst_insert(rst_tree *tree, void **object) {
 
 int sec__rst_find(rst_tree *tree, void **probe) {
     if (!usable(tree) || probe == nullptr || *probe == nullptr) return -1;
-    const rst_node *n = tree->rst_root;
-    if (n != nullptr) fetch_ahead(n);
-    while (n != nullptr) {
-        // The next level's objects and the level after's nodes are fetched
-        // while this level compares: a search of a tree larger than the
-        // caches waits for about one miss per level instead of two.
-        if (n->left != nullptr) fetch_ahead(n->left);
-        if (n->right != nullptr) fetch_ahead(n->right);
-        int r = tree->rst_compare(*probe, n->object);
-        if (r == 0) {
-            *probe = n->object;
-            return 1;
-        }
-        n = r < 0 ? n->left : n->right;
-    }
-    return 0;
+    void *found = rst_search(tree, *probe, tree->rst_compare);
+    if (found == nullptr) return 0;
+    *probe = found;
+    return 1;
 }
 
 int sec__rst_delete(rst_tree *tree, void **probe) {
