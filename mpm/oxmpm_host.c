@@ -26,6 +26,8 @@
 #include <stdlib.h>
 #include <string.h>
 
+#include <emmintrin.h>
+
 #define EXPORT __attribute__((visibility("default")))
 
 enum {
@@ -98,34 +100,34 @@ struct small_block {
 };
 static _Thread_local struct small_block small;
 
-/* An id is copied eight bytes at a time (x86-64: little-endian, unaligned
- * loads) in one pass that also finds its separators.  Each part goes to the
- * small block in whole-word stores, starting at a word boundary and padded
- * with NULs to the next one, so that the word loads with which libox_idm
- * compares the parts just afterwards find each of them in one earlier store. */
-typedef uint64_t unaligned_word __attribute__((may_alias, aligned(1)));
-#define ONES 0x0101010101010101ull
+/* An id is copied sixteen bytes at a time (SSE2, which every x86-64
+ * processor has) in one pass that also finds its separator.  Each part goes
+ * to the small block in whole 16-byte stores, starting at a 16-byte boundary
+ * of the text and padded with NULs to the next one, so that the loads with
+ * which libox_idm compares the parts just afterwards find each of them
+ * within one earlier store. */
 
-/* The high bit of each byte of `w` that is zero; the lowest one is exact. */
-static inline uint64_t zero_bytes(uint64_t w) { return (w - ONES) & ~w & (ONES << 7); }
-
-/* `w` with its ASCII capitals folded to lower case, all eight at once. */
-static inline uint64_t fold_word(uint64_t w) {
-    const uint64_t low7 = w & ~(ONES << 7);
-    const uint64_t from_a = low7 + ONES * (0x80 - 'A'); /* high bit: at least 'A' */
-    const uint64_t past_z = low7 + ONES * (0x7F - 'Z'); /* high bit: past 'Z' */
-    return w | ((from_a & ~past_z & ~w & (ONES << 7)) >> 2);
+/* `v` with its ASCII capitals folded to lower case, all sixteen at once. */
+static inline __m128i fold_block(__m128i v) {
+    const __m128i capital = _mm_and_si128(_mm_cmpgt_epi8(v, _mm_set1_epi8('A' - 1)), _mm_cmplt_epi8(v, _mm_set1_epi8('Z' + 1)));
+    return _mm_or_si128(v, _mm_and_si128(capital, _mm_set1_epi8(0x20)));
 }
 
-/* The eight bytes of text at `s`: read as one word where that cannot cross
+/* The sixteen bytes of text at `s`: read at once where that cannot cross
  * into the next page (the bytes past a NUL it may hold then lie on the
  * NUL's own page; the sanitizers would take them for someone else's memory,
  * hence no checks here), else byte by byte up to the NUL. */
-__attribute__((no_sanitize("address", "thread"))) static inline uint64_t text_word(const char *s) {
-    if (((uintptr_t)s & 4095) <= 4096 - 8) return *(const unaligned_word *)s;
-    uint64_t w = 0;
-    for (int k = 0; k < 8 && s[k] != '\0'; ++k) w |= (uint64_t)(unsigned char)s[k] << (8 * k);
-    return w;
+__attribute__((no_sanitize("address", "thread"))) static inline __m128i text_block(const char *s) {
+    if (((uintptr_t)s & 4095) <= 4096 - 16) return _mm_loadu_si128((const __m128i *)(const void *)s);
+    char bytes[16] = {0};
+    for (int k = 0; k < 16 && s[k] != '\0'; ++k) bytes[k] = s[k];
+    return _mm_loadu_si128((const __m128i *)(const void *)bytes);
+}
+
+/* The first `k` bytes of `v` (k < 16), the rest zero. */
+static inline __m128i first_bytes(__m128i v, unsigned k) {
+    static const char mask[32] = {-1, -1, -1, -1, -1, -1, -1, -1, -1, -1, -1, -1, -1, -1, -1, -1};
+    return _mm_and_si128(v, _mm_loadu_si128((const __m128i *)(const void *)(mask + 16 - k)));
 }
 
 static struct block *new_block(size_t text_size) {
@@ -148,15 +150,10 @@ static void free_block(char **tokens) {
         free(b);
         return;
     }
-    /* The small block's texts are whole words (see fill_id_small), and any
-     * text leaves room for two 16-byte stores: zeroed in line. */
-    typedef char zero16 __attribute__((vector_size(16), may_alias, aligned(1)));
-    const zero16 zero = {0};
-    char *t = b->text;
-    char *const end = (char *)b + b->size;
-    *(zero16 *)t = zero;
-    *(zero16 *)(t + 16) = zero;
-    for (t += 32; t < end; t += 8) *(unaligned_word *)t = 0;
+    /* The small block's texts are whole 16-byte blocks (see fill_id_small):
+     * zeroed in line. */
+    for (char *t = b->text, *end = (char *)b + b->size; t < end; t += 16)
+        _mm_storeu_si128((__m128i *)(void *)t, _mm_setzero_si128());
     __atomic_store_n(small_in_use, 0, __ATOMIC_RELEASE);
 }
 
@@ -201,23 +198,23 @@ static int fill_id_small(const char *network_id, idm_id *id) {
     const char *s = network_id;
     const char *part_begin = s;
     char *t = text;
+    const __m128i nul = _mm_setzero_si128(), at = _mm_set1_epi8('@');
     for (;;) {
         if (t == end) goto fail;
-        const uint64_t w = text_word(s);
-        const uint64_t m = zero_bytes(w) | zero_bytes(w ^ (ONES * '@'));
+        const __m128i v = text_block(s);
+        const unsigned m = (unsigned)_mm_movemask_epi8(_mm_or_si128(_mm_cmpeq_epi8(v, nul), _mm_cmpeq_epi8(v, at)));
         if (m == 0) {
-            *(unaligned_word *)t = host ? fold_word(w) : w;
-            s += 8;
-            t += 8;
+            _mm_storeu_si128((__m128i *)(void *)t, host ? fold_block(v) : v);
+            s += 16;
+            t += 16;
             continue;
         }
-        const unsigned k = (unsigned)__builtin_ctzll(m) >> 3;
-        const uint64_t last = k != 0 ? w & (~0ull >> (64 - 8 * k)) : 0;
-        *(unaligned_word *)t = host ? fold_word(last) : last;
-        t += 8;
+        const unsigned k = (unsigned)__builtin_ctz(m);
+        const __m128i last = first_bytes(v, k);
+        _mm_storeu_si128((__m128i *)(void *)t, host ? fold_block(last) : last);
+        t += 16;
         s += k;
-        const char c = (char)(w >> (8 * k));
-        if (s == part_begin || c != (host ? '\0' : '@')) goto fail; /* an empty part, no '@' or a second one */
+        if (s == part_begin || *s != (host ? '\0' : '@')) goto fail; /* an empty part, no '@' or a second one */
         if (host) break;
         host = 1;
         id->rgy = t;

@@ -24,6 +24,8 @@
 #include <stdlib.h>
 #include <string.h>
 
+#include <emmintrin.h>
+
 #define EXPORT __attribute__((visibility("default")))
 
 enum {
@@ -82,26 +84,28 @@ struct small_block {
 };
 static _Thread_local struct small_block small;
 
-/* An id is copied eight bytes at a time (x86-64: little-endian, unaligned
- * loads) in one pass that also finds its separators.  Each part goes to the
- * small block in whole-word stores, starting at a word boundary and padded
- * with NULs to the next one, so that the word loads with which libox_idm
- * compares the parts just afterwards find each of them in one earlier store. */
-typedef uint64_t unaligned_word __attribute__((may_alias, aligned(1)));
-#define ONES 0x0101010101010101ull
+/* An id is copied sixteen bytes at a time (SSE2, which every x86-64
+ * processor has) in one pass that also finds its separators.  Each part goes
+ * to the small block in whole 16-byte stores, starting at a 16-byte boundary
+ * of the text and padded with NULs to the next one, so that the loads with
+ * which libox_idm compares the parts just afterwards find each of them
+ * within one earlier store. */
 
-/* The high bit of each byte of `w` that is zero; the lowest one is exact. */
-static inline uint64_t zero_bytes(uint64_t w) { return (w - ONES) & ~w & (ONES << 7); }
-
-/* The eight bytes of text at `s`: read as one word where that cannot cross
+/* The sixteen bytes of text at `s`: read at once where that cannot cross
  * into the next page (the bytes past a NUL it may hold then lie on the
  * NUL's own page; the sanitizers would take them for someone else's memory,
  * hence no checks here), else byte by byte up to the NUL. */
-__attribute__((no_sanitize("address", "thread"))) static inline uint64_t text_word(const char *s) {
-    if (((uintptr_t)s & 4095) <= 4096 - 8) return *(const unaligned_word *)s;
-    uint64_t w = 0;
-    for (int k = 0; k < 8 && s[k] != '\0'; ++k) w |= (uint64_t)(unsigned char)s[k] << (8 * k);
-    return w;
+__attribute__((no_sanitize("address", "thread"))) static inline __m128i text_block(const char *s) {
+    if (((uintptr_t)s & 4095) <= 4096 - 16) return _mm_loadu_si128((const __m128i *)(const void *)s);
+    char bytes[16] = {0};
+    for (int k = 0; k < 16 && s[k] != '\0'; ++k) bytes[k] = s[k];
+    return _mm_loadu_si128((const __m128i *)(const void *)bytes);
+}
+
+/* The first `k` bytes of `v` (k < 16), the rest zero. */
+static inline __m128i first_bytes(__m128i v, unsigned k) {
+    static const char mask[32] = {-1, -1, -1, -1, -1, -1, -1, -1, -1, -1, -1, -1, -1, -1, -1, -1};
+    return _mm_and_si128(v, _mm_loadu_si128((const __m128i *)(const void *)(mask + 16 - k)));
 }
 
 static char *put(char *dst, const char *src, size_t n) {
@@ -149,15 +153,10 @@ static void free_block(char **tokens) {
         free(b);
         return;
     }
-    /* The small block's texts are whole words (see fill_id_small), and any
-     * text leaves room for two 16-byte stores: zeroed in line. */
-    typedef char zero16 __attribute__((vector_size(16), may_alias, aligned(1)));
-    const zero16 zero = {0};
-    char *t = b->text;
-    char *const end = (char *)b + b->size;
-    *(zero16 *)t = zero;
-    *(zero16 *)(t + 16) = zero;
-    for (t += 32; t < end; t += 8) *(unaligned_word *)t = 0;
+    /* The small block's texts are whole 16-byte blocks (see fill_id_small):
+     * zeroed in line. */
+    for (char *t = b->text, *end = (char *)b + b->size; t < end; t += 16)
+        _mm_storeu_si128((__m128i *)(void *)t, _mm_setzero_si128());
     __atomic_store_n(small_in_use, 0, __ATOMIC_RELEASE);
 }
 
@@ -198,23 +197,25 @@ static int fill_id_small(const char *network_id, idm_id *id) {
     char *t = text;
     /* A part ends at its first NUL, '@' or `other` ('/' for the name and the
      * instance, which are judged by the separator found; '@' for the realm). */
-    uint64_t other = ONES * '/';
+    const __m128i nul = _mm_setzero_si128(), at = _mm_set1_epi8('@');
+    __m128i other = _mm_set1_epi8('/');
     b->tokens[1] = NULL;
     for (;;) {
         if (t == end) goto fail;
-        const uint64_t w = text_word(s);
-        const uint64_t m = zero_bytes(w) | zero_bytes(w ^ (ONES * '@')) | zero_bytes(w ^ other);
+        const __m128i v = text_block(s);
+        const unsigned m = (unsigned)_mm_movemask_epi8(
+            _mm_or_si128(_mm_or_si128(_mm_cmpeq_epi8(v, nul), _mm_cmpeq_epi8(v, at)), _mm_cmpeq_epi8(v, other)));
         if (m == 0) {
-            *(unaligned_word *)t = w;
-            s += 8;
-            t += 8;
+            _mm_storeu_si128((__m128i *)(void *)t, v);
+            s += 16;
+            t += 16;
             continue;
         }
-        const unsigned k = (unsigned)__builtin_ctzll(m) >> 3;
-        *(unaligned_word *)t = k != 0 ? w & (~0ull >> (64 - 8 * k)) : 0;
-        t += 8;
+        const unsigned k = (unsigned)__builtin_ctz(m);
+        _mm_storeu_si128((__m128i *)(void *)t, first_bytes(v, k));
+        t += 16;
         s += k;
-        const char c = (char)(w >> (8 * k));
+        const char c = *s;
         if (s == part_begin) goto fail; /* an empty part */
         if (part == REALM) {
             if (c != '\0') goto fail;
@@ -225,7 +226,7 @@ static int fill_id_small(const char *network_id, idm_id *id) {
             b->tokens[1] = t;
         } else if (c == '@') {
             part = REALM;
-            other = ONES * '@';
+            other = at;
             id->rgy = t;
         } else {
             goto fail;

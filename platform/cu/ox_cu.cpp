@@ -4,6 +4,8 @@
 // clock override are guarded by g_mutex / atomics.
 #include "ox_cu.h"
 
+#include <emmintrin.h>
+
 #include <atomic>
 #include <cerrno>
 #include <cstdarg>
@@ -162,6 +164,16 @@ __attribute__((noinline)) void spill_text(Record &r, const char *s, size_t n) {
 using UnalignedWord = uint64_t __attribute__((may_alias, aligned(1)));
 __attribute__((no_sanitize("address", "thread"))) inline uint32_t keep_text(Record &r, const char *s) {
     const uint32_t at = r.used;
+    // Most inserts are shorter than sixteen bytes: one SSE2 load, store and
+    // compare where the load cannot cross into the next page.
+    if (!r.spilled && at + 16 <= sizeof r.texts && (reinterpret_cast<uintptr_t>(s) & 4095) <= 4096 - 16) {
+        const __m128i v = _mm_loadu_si128(reinterpret_cast<const __m128i *>(s));
+        _mm_storeu_si128(reinterpret_cast<__m128i *>(r.texts + at), v);
+        if (const unsigned nul = static_cast<unsigned>(_mm_movemask_epi8(_mm_cmpeq_epi8(v, _mm_setzero_si128())))) {
+            r.used = at + static_cast<uint32_t>(__builtin_ctz(nul)) + 1;
+            return at;
+        }
+    }
     if (!r.spilled) {
         char *d = r.texts + at;
         const char *const end = r.texts + sizeof r.texts;

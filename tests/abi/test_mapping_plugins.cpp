@@ -60,17 +60,18 @@ TEST(MappingPlugins, HostAndPrincipalIdentities) {
     });
 }
 
-// The plug-ins read an id eight bytes at a time: one that ends just before
-// an inaccessible page must be read up to its NUL and no further.
+// The plug-ins read an id sixteen bytes at a time: one that ends just before
+// an inaccessible page must be read up to its NUL and no further (fourteen
+// characters: its first block would end one byte past the page).
 TEST(MappingPlugins, IdsEndingAtAPageBoundary) {
     OXTEST_REQUIRE_NAMESPACE();
     ASSERT_EQ(oxmpm_host_register() + oxmpm_principal_register(), 0);
-    oxtest::write_file(oxtest::kLocalMap, "host:alice@node1=alice\nprinc:joe@EXAMPLE.ORG=joe\n");
+    oxtest::write_file(oxtest::kLocalMap, "host:alice@node1234=alice\nprinc:jo@EXAMPLE.ORG=joe\n");
     const size_t page = static_cast<size_t>(sysconf(_SC_PAGESIZE));
     auto *pages = static_cast<char *>(mmap(nullptr, 2 * page, PROT_READ | PROT_WRITE, MAP_PRIVATE | MAP_ANONYMOUS, -1, 0));
     ASSERT_NE(pages, MAP_FAILED);
     ASSERT_EQ(mprotect(pages + page, page, PROT_NONE), 0);
-    for (const char *id : {"alice@node1", "joe@EXAMPLE.ORG"}) {
+    for (const char *id : {"alice@node1234", "jo@EXAMPLE.ORG"}) {
         char *at_end = pages + page - std::strlen(id) - 1;
         std::memcpy(at_end, id, std::strlen(id) + 1);
         idm_buffer local{};

@@ -8,6 +8,8 @@
 // match and the growth of the cache.
 #include "oxidm_natmap.h"
 
+#include <emmintrin.h>
+
 #include <algorithm>
 
 #include "oxidm_diag.h"
@@ -71,40 +73,34 @@ void token_line(char (&line)[kLineBuffer], int32_t count, char *const *tokens) {
 
 namespace idm {
 
-// Word-at-a-time scanning.  A word of a text is read only where it cannot
-// cross into the next page, so reading past a text's NUL touches nothing its
-// own page does not hold; the sanitizers would take those bytes for a read of
+// Sixteen characters at a time (SSE2, which every x86-64 processor has).
+// Sixteen bytes of a text are read at once only where they cannot cross
+// into the next page, so reading past a text's NUL touches nothing its own
+// page does not hold; the sanitizers would take those bytes for a read of
 // someone else's memory, hence no sanitizer checks in the routine that reads
 // them.
 namespace {
 
-using UnalignedWord = uint64_t __attribute__((may_alias, aligned(1)));
-constexpr uint64_t kOnes = 0x0101010101010101ull;
-constexpr uint64_t kHighs = 0x8080808080808080ull;
-constexpr uint64_t kStars = kOnes * static_cast<unsigned char>(IDM_WILDCARD);
-
-// The high bit of each byte of `w` that is zero (the lowest one is exact:
-// only bytes above a zero byte can be flagged wrongly), and of each byte that
-// is not zero (exact).
-inline uint64_t zero_bytes(uint64_t w) { return (w - kOnes) & ~w & kHighs; }
-inline uint64_t nonzero_bytes(uint64_t w) { return (((w & ~kHighs) + ~kHighs) | w) & kHighs; }
-inline bool word_readable(const char *p) { return (reinterpret_cast<uintptr_t>(p) & 4095) <= 4096 - 8; }
+inline bool block_readable(const char *p) { return (reinterpret_cast<uintptr_t>(p) & 4095) <= 4096 - 16; }
 
 // Advances p and t past their common literal prefix, to the first place
 // where they differ or the pattern holds a NUL or a '*'.
 __attribute__((no_sanitize("address", "thread"))) inline void skip_literal_prefix(const char *&p, const char *&t) {
-    while (word_readable(p) && word_readable(t)) {
-        const uint64_t a = *reinterpret_cast<const UnalignedWord *>(p);
-        const uint64_t b = *reinterpret_cast<const UnalignedWord *>(t);
-        const uint64_t stop = nonzero_bytes(a ^ b) | zero_bytes(a) | zero_bytes(a ^ kStars);
-        if (stop != 0) {
-            const int k = __builtin_ctzll(stop) >> 3;
+    const __m128i nul = _mm_setzero_si128();
+    const __m128i star = _mm_set1_epi8(IDM_WILDCARD);
+    while (block_readable(p) && block_readable(t)) {
+        const __m128i a = _mm_loadu_si128(reinterpret_cast<const __m128i *>(p));
+        const __m128i b = _mm_loadu_si128(reinterpret_cast<const __m128i *>(t));
+        const __m128i stop = _mm_or_si128(_mm_cmpeq_epi8(a, nul), _mm_cmpeq_epi8(a, star));
+        const unsigned m = static_cast<unsigned>(_mm_movemask_epi8(stop)) | (~static_cast<unsigned>(_mm_movemask_epi8(_mm_cmpeq_epi8(a, b))) & 0xFFFFu);
+        if (m != 0) {
+            const int k = __builtin_ctz(m);
             p += k;
             t += k;
             return;
         }
-        p += 8;
-        t += 8;
+        p += 16;
+        t += 16;
     }
     while (*p != IDM_WILDCARD && *p != '\0' && *p == *t) {
         ++p;
