@@ -11,7 +11,7 @@ namespace {
 using oxtest::kNodeInfo;
 
 const char kFile[] = "NODE:\nNAME: hosta\nADDRESS: 10.1.1.1\nCLUSTER: clA clB\nNODE:\nNAME: hostc\nCLUSTER: ClA\n"
-                     "NODE:\nNAME: beef 1host\nADDRESS: ::1 fd00::1 FD00::2\nCLUSTER: clD\n";
+                     "NODE:\nNAME: beef 1host\nADDRESS: ::1 fd00::1 FD00::2 1.2.3.4\nCLUSTER: clD\n";
 
 class ClusterQueries : public oxtest::Test {
   protected:
@@ -37,7 +37,7 @@ TEST_F(ClusterQueries, Answers) {
         {"not listed", "hostb", "clA", -1, -1},
         {"address from a colon", "::1", "clD", 1, 1},      {"from a hex letter", "fd00::1", "clD", 1, 1},
         {"from an upper-case one", "FD00::2", "clD", 1, 1}, {"name of hex letters", "beef", "clD", 1, 1},
-        {"name from a digit", "1host", "clD", 1, 1},
+        {"name from a digit", "1host", "clD", 1, 1},        {"address with a dot second", "1.2.3.4", "clD", 1, 1},
         {"null host", nullptr, "clA", -1, -1},
     };
     for (const auto &row : rows) {

@@ -172,3 +172,17 @@ TEST_F(ClusterFile, AFileChangedWhileReadIsReadAgain) {
 }
 
 }  // namespace
+
+// A record copies its key and its cluster names; a null name stays null.
+TEST(ClusterRecord, CopiesKeyAndNamesKeepingNullEntries) {
+    char name[] = "clA";
+    char *names[] = {nullptr, name};
+    idm_clnode *node = nullptr;
+    ASSERT_EQ(idm__getnode("host", names, 2, &node), kOk);
+    name[0] = 'x';
+    EXPECT_STREQ(node->key, "host");
+    ASSERT_EQ(node->count, 2);
+    EXPECT_EQ(node->clusters[0], nullptr);
+    EXPECT_STREQ(node->clusters[1], "clA");
+    idm__rtree_cleanup_routine(node);
+}
