@@ -4,6 +4,7 @@
 #include <sys/mman.h>
 
 #include <cstring>
+#include <set>
 #include <string>
 #include <vector>
 
@@ -86,6 +87,8 @@ TEST(NatmapRules, MatcherAgreesWithReference) {
                 const bool long_m = ref::match(long_p, long_t);
                 ASSERT_EQ(idm::wildcard_match(long_p.c_str(), long_t.c_str()), long_m) << long_p << " " << long_t;
                 ASSERT_EQ(idm::wildcard_match(pattern_page.put(long_p), text_page.put(long_t)), long_m);
+                ASSERT_EQ(idm::wildcard_match(pattern_page.put(long_p), long_t.c_str()), long_m);
+                ASSERT_EQ(idm::wildcard_match(long_p.c_str(), text_page.put(long_t)), long_m);
             }
             ASSERT_EQ(idm__native_match_token(p.c_str(), t.c_str()), m ? idm::kOk : idm::kRuleInvalid) << p << " " << t;
             ASSERT_TRUE(m || reported(idm::kRuleInvalid, idm::kMsg666, {p, t}));
@@ -188,6 +191,20 @@ TEST(NatmapRules, FailedApplicationReportsTheFirstFailingCheck) {
         EXPECT_EQ(oxtest::trace_records().back().text(7), l.line);
         idm__release_buffer(&result);
     }
+}
+
+// With the API trace on, the application of a valid rule to a complete id
+// still runs both checks, whose entry points the trace records.
+TEST(NatmapRules, ApplicationTracesItsChecksWhenTheApiTraceIsOn) {
+    Rule rule("t", "r", {"a"}, {}, IDM_RULE_VALID);
+    Id id("t", "r", {"b"});
+    idm_buffer local{};
+    oxtest::set_trace_levels(0, 1, 0, 0, 0);
+    EXPECT_EQ(idm__native_apply_rule(&rule.r, &id.id, &local), idm::kRuleInvalid);
+    std::set<int> ids;
+    for (const oxtest::TraceRecord &r : oxtest::trace_records()) ids.insert(r.id);
+    oxtest::reset_trace();
+    EXPECT_EQ(ids.count(idm::tp::kCheckRuleEntry) + ids.count(idm::tp::kCheckIdEntry), 2u);
 }
 
 }  // namespace
