@@ -198,6 +198,7 @@ static int fill_id_small(const char *network_id, idm_id *id) {
     const char *s = network_id;
     const char *part_begin = s;
     char *t = text;
+    char *rgy = NULL; /* the last part; the id gets it only when the text is whole */
     const __m128i nul = _mm_setzero_si128(), at = _mm_set1_epi8('@');
     for (;;) {
         if (t == end) goto fail;
@@ -217,13 +218,14 @@ static int fill_id_small(const char *network_id, idm_id *id) {
         if (s == part_begin || *s != (host ? '\0' : '@')) goto fail; /* an empty part, no '@' or a second one */
         if (host) break;
         host = 1;
-        id->rgy = t;
+        rgy = t;
         part_begin = ++s;
     }
     sm->in_use = 1;
     b->size = (size_t)(t - (char *)b);
     b->small_in_use = &sm->in_use;
     b->tokens[0] = text;
+    id->rgy = rgy;
     id->rgy_type = mnemonic;
     id->token_cnt = 1;
     id->tokens = b->tokens;

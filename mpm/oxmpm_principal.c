@@ -195,6 +195,7 @@ static int fill_id_small(const char *network_id, idm_id *id) {
     const char *s = network_id;
     const char *part_begin = s;
     char *t = text;
+    char *rgy = NULL; /* the last part; the id gets it only when the text is whole */
     /* A part ends at its first NUL, '@' or `other` ('/' for the name and the
      * instance, which are judged by the separator found; '@' for the realm). */
     const __m128i nul = _mm_setzero_si128(), at = _mm_set1_epi8('@');
@@ -227,7 +228,7 @@ static int fill_id_small(const char *network_id, idm_id *id) {
         } else if (c == '@') {
             part = REALM;
             other = at;
-            id->rgy = t;
+            rgy = t;
         } else {
             goto fail;
         }
@@ -239,6 +240,7 @@ static int fill_id_small(const char *network_id, idm_id *id) {
     b->tokens[0] = text;
     b->mapping.length = 0;
     b->mapping.value = NULL;
+    id->rgy = rgy;
     id->rgy_type = mnemonic;
     id->token_cnt = b->tokens[1] != NULL ? 2 : 1;
     id->tokens = b->tokens;

@@ -112,7 +112,7 @@ __attribute__((no_sanitize("address", "thread"))) inline void skip_literal_prefi
 
 // The walk compares two texts per entry: the matcher is inlined there.
 [[gnu::always_inline]] inline bool match_wildcard(const char *pattern, const char *text) {
-    // One pass over the literal prefix, eight characters at a time: most
+    // One pass over the literal prefix, sixteen characters at a time: most
     // comparisons are of equal texts (a realm) or end early (a token).
     const char *p = pattern;
     const char *t = text;
