@@ -4,8 +4,6 @@
 // clock override are guarded by g_mutex / atomics.
 #include "ox_cu.h"
 
-#include <emmintrin.h>
-
 #include <atomic>
 #include <cerrno>
 #include <cstdarg>
@@ -68,18 +66,13 @@ struct ThreadErrors {
     TypeSlot slots[kTypeSlots];
 };
 
+// Reached through the dynamic TLS models only (the library is built with TLS
+// descriptors, -mtls-dialect=gnu2, so after the first call of a thread this
+// is one indirect load): an object loaded with dlopen has no claim on the
+// static TLS area, and a block of this size would not find room there.
 thread_local ThreadErrors t_errors;
 
-// The address of the thread's block, in the static TLS area (eight bytes,
-// which a library loaded with dlopen still finds room for there): one load
-// where reaching the block itself takes a call.
-__attribute__((tls_model("initial-exec"))) thread_local ThreadErrors *t_self = nullptr;
-
-inline ThreadErrors &errors() {
-    ThreadErrors *p = t_self;
-    if (__builtin_expect(p == nullptr, 0)) t_self = p = &t_errors;
-    return *p;
-}
+inline ThreadErrors &errors() { return t_errors; }
 
 // Texts that did not fit a record's inline space, and the default text of an
 // error made current again from a handle (touched only on those paths).
@@ -156,47 +149,13 @@ __attribute__((noinline)) void spill_text(Record &r, const char *s, size_t n) {
 }
 
 // Appends `s` with its NUL to the record's texts; returns where it starts.
-// Inserts are short: copying eight bytes at a time while looking for the NUL
-// beats a length scan and a copy call.  A word is read only where it cannot
-// cross into the next page, so reading past the NUL touches nothing the
-// text's own page does not hold (hence no sanitizer checks here: they would
-// take the bytes past the NUL for a read of someone else's memory).
-using UnalignedWord = uint64_t __attribute__((may_alias, aligned(1)));
-__attribute__((no_sanitize("address", "thread"))) inline uint32_t keep_text(Record &r, const char *s) {
+uint32_t keep_text(Record &r, const char *s) {
     const uint32_t at = r.used;
-    // Most inserts are shorter than sixteen bytes: one SSE2 load, store and
-    // compare where the load cannot cross into the next page.
-    if (!r.spilled && at + 16 <= sizeof r.texts && (reinterpret_cast<uintptr_t>(s) & 4095) <= 4096 - 16) {
-        const __m128i v = _mm_loadu_si128(reinterpret_cast<const __m128i *>(s));
-        _mm_storeu_si128(reinterpret_cast<__m128i *>(r.texts + at), v);
-        if (const unsigned nul = static_cast<unsigned>(_mm_movemask_epi8(_mm_cmpeq_epi8(v, _mm_setzero_si128())))) {
-            r.used = at + static_cast<uint32_t>(__builtin_ctz(nul)) + 1;
-            return at;
-        }
-    }
-    if (!r.spilled) {
-        char *d = r.texts + at;
-        const char *const end = r.texts + sizeof r.texts;
-        const char *c = s;
-        while (end - d >= 8 && (reinterpret_cast<uintptr_t>(c) & 4095) <= 4096 - 8) {
-            const uint64_t w = *reinterpret_cast<const UnalignedWord *>(c);
-            *reinterpret_cast<UnalignedWord *>(d) = w;
-            const uint64_t nul = (w - 0x0101010101010101ull) & ~w & 0x8080808080808080ull;
-            if (nul != 0) {  // the lowest flagged byte is the first NUL
-                r.used = static_cast<uint32_t>(d - r.texts) + (__builtin_ctzll(nul) >> 3) + 1;
-                return at;
-            }
-            c += 8;
-            d += 8;
-        }
-        for (; d != end; ++c)
-            if ((*d++ = *c) == '\0') {
-                r.used = static_cast<uint32_t>(d - r.texts);
-                return at;
-            }
-    }
     const size_t n = std::strlen(s) + 1;
-    spill_text(r, s, n);
+    if (!r.spilled && n <= sizeof r.texts - at)
+        std::memcpy(r.texts + at, s, n);
+    else
+        spill_text(r, s, n);
     r.used = at + static_cast<uint32_t>(n);
     return at;
 }
